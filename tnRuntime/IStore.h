@@ -1,0 +1,59 @@
+#pragma once
+
+// Where object images live between processes.
+//
+// A store keeps, per object identity, the object's image: the registered name
+// of its class and the bytes its Serialise slot wrote. It also keeps named
+// roots (name -> identity) and the identity counter. All changes of one
+// commit are applied by Commit as a single atomic step: after a crash the
+// store holds the previous commit or the new one, never a mix.
+//
+// Stores report unreadable or corrupt contents by throwing RuntimeError.
+
+#include <functional>
+#include <map>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/Types.h"
+
+namespace tarn {
+
+struct StoredImage {
+    std::string className;
+    std::vector<octet_t> bytes;
+};
+
+// Everything one commit changes.
+struct CommitBatch {
+    std::vector<std::pair<uint64, StoredImage>> writes;  // identity -> new image
+    std::vector<uint64> deletes;                         // identities to remove
+    std::map<std::string, uint64> roots;                 // named roots to set
+    uint64 nextIdentity = 1;                             // the identity counter
+};
+
+struct StoreStats {
+    ssize_t numImages = 0;
+    ssize_t numImageBytes = 0;  // bytes of all images as stored, framing included
+};
+
+class IStore {
+public:
+    virtual ~IStore() = default;
+
+    // The image of `oid`, or nothing when the store has none.
+    virtual std::optional<StoredImage> Load(uint64 oid) = 0;
+    virtual std::optional<uint64> FindRoot(std::string_view name) = 0;
+    virtual std::map<std::string, uint64> Roots() = 0;
+    // The next identity to hand out (1 in a new store).
+    virtual uint64 NextIdentity() = 0;
+    virtual void Commit(const CommitBatch& batch) = 0;
+    // Calls `fn` for every stored identity, in increasing order.
+    virtual void ForEachIdentity(const std::function<void(uint64)>& fn) = 0;
+    virtual StoreStats Stats() = 0;
+};
+
+}  // namespace tarn
