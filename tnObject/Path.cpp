@@ -40,7 +40,9 @@ Path& Path::operator=(const Path& rhs) {
     return *this;
 }
 
-Path::~Path() { ReleaseHeap(); }
+Path::~Path() {
+    ReleaseHeap();
+}
 
 void Path::ReleaseHeap() {
     if (!IsLocal()) {
@@ -72,7 +74,19 @@ void Path::InitBuffer(ssize_t n) {
     }
 }
 
-octet_t* Path::BeginReserveLocal() { return m_localBuffer + m_size; }
+octet_t* Path::BeginReserveLocal() {
+    TARN_ASSERT(m_size <= LOCAL_CAPACITY);
+    if (!IsLocal()) {
+        // Bring short content back from the heap into the value.
+        octet_t* heap = m_heapBuffer;
+        if (m_size > 0) {
+            std::memcpy(m_localBuffer, heap, static_cast<std::size_t>(m_size));
+        }
+        delete[] heap;
+        m_capacity = LOCAL_CAPACITY;
+    }
+    return m_localBuffer + m_size;
+}
 
 void Path::EndReserveLocal(octet_t* end) {
     m_size = end - m_localBuffer;
@@ -80,7 +94,9 @@ void Path::EndReserveLocal(octet_t* end) {
 }
 
 octet_t* Path::BeginReserveHeap(ssize_t n) {
-    reserve(m_size + n);
+    if (IsLocal() || m_capacity < m_size + n) {
+        MoveToHeap(std::max({m_size + n, 2 * m_capacity, LOCAL_CAPACITY + 1}));
+    }
     return m_heapBuffer + m_size;
 }
 
@@ -103,7 +119,10 @@ void Path::reserve(ssize_t n) {
     if (n <= m_capacity) {
         return;
     }
-    ssize_t capacity = std::max(n, 2 * m_capacity);
+    MoveToHeap(std::max(n, 2 * m_capacity));
+}
+
+void Path::MoveToHeap(ssize_t capacity) {
     octet_t* buffer = new octet_t[static_cast<std::size_t>(capacity)];
     if (m_size > 0) {
         std::memcpy(buffer, data(), static_cast<std::size_t>(m_size));

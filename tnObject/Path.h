@@ -83,6 +83,8 @@ public:
 
 private:
     void ReleaseHeap();
+    // Copies the content into a new heap buffer of `capacity` (> 16) bytes.
+    void MoveToHeap(ssize_t capacity);
 };
 
 xostream& operator<<(xostream& os, const Path& p);

@@ -3,7 +3,6 @@
 // A 16-byte globally unique identifier. Names a site (SiteNum) in the
 // per-site offset tables. Plain and trivially copyable.
 
-#include <compare>
 #include <cstring>
 #include <optional>
 #include <string>
@@ -32,7 +31,9 @@ inline bool operator==(const Guid& a, const Guid& b) {
            std::memcmp(a.Data4, b.Data4, sizeof a.Data4) == 0;
 }
 
-inline bool operator!=(const Guid& a, const Guid& b) { return !(a == b); }
+inline bool operator!=(const Guid& a, const Guid& b) {
+    return !(a == b);
+}
 
 // Data1, then Data2, then Data3 as numbers, then Data4 bytewise.
 inline bool operator<(const Guid& a, const Guid& b) {

@@ -17,6 +17,9 @@
 
 namespace tarn {
 
+// Integers print through put(long); every 64-bit integer of the store is one.
+static_assert(sizeof(long) == 8, "long is the 64-bit integer on the store's targets");
+
 using xchar = char;
 using streamsize = ssize_t;
 
@@ -98,11 +101,37 @@ public:
     ssize_t m_indent;
 };
 
-inline xostream& operator<<(xostream& os, char c) { return os.put(c); }
-inline xostream& operator<<(xostream& os, const char* s) { return os.put(s); }
-inline xostream& operator<<(xostream& os, long x) { return os.put(x); }
-inline xostream& operator<<(xostream& os, int x) { return os.put(static_cast<long>(x)); }
-inline xostream& operator<<(xostream& os, unsigned long x) { return os.put(x); }
+inline xostream& operator<<(xostream& os, char c) {
+    return os.put(c);
+}
+inline xostream& operator<<(xostream& os, const char* s) {
+    return os.put(s);
+}
+inline xostream& operator<<(xostream& os, long x) {
+    return os.put(x);
+}
+inline xostream& operator<<(xostream& os, int x) {
+    return os.put(static_cast<long>(x));
+}
+inline xostream& operator<<(xostream& os, unsigned x) {
+    return os.put(x);
+}
+inline xostream& operator<<(xostream& os, unsigned long x) {
+    return os.put(x);
+}
+// long long and long are both 64 bits on the store's targets.
+inline xostream& operator<<(xostream& os, long long x) {
+    return os.put(static_cast<long>(x));
+}
+inline xostream& operator<<(xostream& os, unsigned long long x) {
+    return os.put(static_cast<unsigned long>(x));
+}
+inline xostream& operator<<(xostream& os, double x) {
+    return os.put(x);
+}
+inline xostream& operator<<(xostream& os, std::string_view s) {
+    return os.put(s.data(), static_cast<ssize_t>(s.size()));
+}
 inline xostream& operator<<(xostream& os, const std::string& s) {
     return os.put(s.data(), static_cast<ssize_t>(s.size()));
 }
