@@ -13,9 +13,13 @@
 namespace tarn {
 namespace {
 
-Path MakePath(const std::string& bytes) { return Path(bytes.data(), ssize_t(bytes.size())); }
+Path MakePath(const std::string& bytes) {
+    return Path(bytes.data(), ssize_t(bytes.size()));
+}
 
-FieldId Key(uint64 oid, const std::string& path) { return FieldId(OID(Seid(oid)), MakePath(path)); }
+FieldId Key(uint64 oid, const std::string& path) {
+    return FieldId(OID(Seid(oid)), MakePath(path));
+}
 
 const std::string kLong = "a path that is much longer than sixteen bytes";
 
@@ -67,13 +71,33 @@ TEST(PathEdit, AppendGrowsIntoTheHeapAndEraseTailShrinks) {
     EXPECT_TRUE(p.empty());
 }
 
+TEST(PathEdit, ReservationMovesBetweenLocalAndHeapKeepingContent) {
+    Path p = MakePath("abc");
+    octet_t* at = p.BeginReserveHeap(2);
+    EXPECT_FALSE(p.IsLocal());
+    at[0] = 'd';
+    at[1] = 'e';
+    p.EndReserveHeap(at + 2);
+    EXPECT_EQ(p, MakePath("abcde"));
+    at = p.BeginReserveLocal();
+    EXPECT_TRUE(p.IsLocal());
+    *at++ = 'f';
+    p.EndReserveLocal(at);
+    EXPECT_EQ(p, MakePath("abcdef"));
+    at = p.BeginReserve(40);
+    std::memset(at, 'g', 40);
+    p.EndReserve(at + 40);
+    EXPECT_EQ(p, MakePath("abcdef" + std::string(40, 'g')));
+}
+
 TEST(FieldIdOrder, OidFirstThenPath) {
     EXPECT_LT(Key(1, "zzz"), Key(2, ""));
     EXPECT_LT(Key(2, "a"), Key(2, "b"));
     EXPECT_FALSE(FieldId() < FieldId());
     EXPECT_LT(FieldId(), Key(1, ""));
     EXPECT_EQ(CompareKeys(Key(3, kLong), Key(3, kLong)), 0);
-    const FieldId keys[] = {FieldId(), Key(0, "a"), Key(1, ""), Key(1, kLong), Key(0xffffffff00000000u, "")};
+    const FieldId keys[] = {FieldId(), Key(0, "a"), Key(1, ""), Key(1, kLong),
+                            Key(0xffffffff00000000u, "")};
     for (const auto& a : keys) {
         for (const auto& b : keys) {
             EXPECT_EQ(CompareKeys(a, b), -CompareKeys(b, a));
@@ -100,6 +124,10 @@ TEST(TextForms, GuidOidAndFieldId) {
     EXPECT_EQ(*ParseGuid(ToString(g)), g);
     EXPECT_FALSE(ParseGuid("0123abcd-0001-beef-8000-00000000002").has_value());
     EXPECT_FALSE(ParseGuid("0123abcd+0001-beef-8000-00000000002a").has_value());
+    // A dash where a digit belongs, including the very last one.
+    EXPECT_FALSE(ParseGuid("0123abcd-0001-beef-8000-00000000002-").has_value());
+    EXPECT_FALSE(ParseGuid("0123abcd-0001-beef-8000-0000000000-a").has_value());
+    EXPECT_EQ(ParseGuid("0123ABCD-0001-BEEF-8000-00000000002A"), g);
     StringOutputStream out;
     {
         xostream os(out);
