@@ -41,7 +41,9 @@ inline bool operator==(const FieldId& a, const FieldId& b) {
     return a.oid == b.oid && a.path == b.path;
 }
 
-inline bool operator!=(const FieldId& a, const FieldId& b) { return !(a == b); }
+inline bool operator!=(const FieldId& a, const FieldId& b) {
+    return !(a == b);
+}
 
 // Byte form: oid as 8 bytes little-endian, the path's length as a
 // variable-length integer, then the path's bytes.

@@ -4,7 +4,9 @@
 
 namespace tarn {
 
-std::string ToString(const OID& oid) { return "#" + std::to_string(oid.value_); }
+std::string ToString(const OID& oid) {
+    return "#" + std::to_string(oid.value_);
+}
 
 xostream& operator<<(xostream& os, const OID& oid) {
     std::string text = ToString(oid);

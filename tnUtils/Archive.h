@@ -138,10 +138,18 @@ public:
 };
 
 // Fixed-width values.
-inline void Serialise(Archive& ar, int64 v) { ar.SerialisePod<int64>(v); }
-inline void Deserialise(InputArchive& ar, int64& v) { ar.DeserialisePod<int64>(v); }
-inline void Serialise(Archive& ar, const Guid& g) { ar.SerialisePod<Guid>(g); }
-inline void Deserialise(InputArchive& ar, Guid& g) { ar.DeserialisePod<Guid>(g); }
+inline void Serialise(Archive& ar, int64 v) {
+    ar.SerialisePod<int64>(v);
+}
+inline void Deserialise(InputArchive& ar, int64& v) {
+    ar.DeserialisePod<int64>(v);
+}
+inline void Serialise(Archive& ar, const Guid& g) {
+    ar.SerialisePod<Guid>(g);
+}
+inline void Deserialise(InputArchive& ar, Guid& g) {
+    ar.DeserialisePod<Guid>(g);
+}
 
 inline Archive& operator<<(Archive& ar, int64 v) {
     Serialise(ar, v);

@@ -7,8 +7,7 @@ namespace tarn {
 
 void AssertionFailed(const char* file, int line, const char* function,
                      const char* expression) noexcept {
-    std::fprintf(stderr, "%s:%d: %s: Assertion \"%s\" failed.\n", file, line, function,
-                 expression);
+    std::fprintf(stderr, "%s:%d: %s: Assertion \"%s\" failed.\n", file, line, function, expression);
     std::fflush(stderr);
     std::abort();
 }

@@ -17,6 +17,6 @@ namespace tarn {
 
 }  // namespace tarn
 
-#define TARN_ASSERT(expr) \
-    ((expr) ? static_cast<void>(0)                                                \
+#define TARN_ASSERT(expr)          \
+    ((expr) ? static_cast<void>(0) \
             : ::tarn::AssertionFailed(__FILE__, __LINE__, __PRETTY_FUNCTION__, #expr))

@@ -27,9 +27,13 @@ void IndentingOutputStream::Write(const char* s, ssize_t n) {
 
 xostream::xostream(IOutputStream& os) : m_os(new IndentingOutputStream(os)) {}
 
-xostream::~xostream() { delete m_os; }
+xostream::~xostream() {
+    delete m_os;
+}
 
-xostream& xostream::put(const char* s) { return put(s, static_cast<ssize_t>(std::strlen(s))); }
+xostream& xostream::put(const char* s) {
+    return put(s, static_cast<ssize_t>(std::strlen(s)));
+}
 
 xostream& xostream::put(long x) {
     char text[24];
@@ -76,12 +80,16 @@ xostream& xostream::flush() {
     return *this;
 }
 
-xostream& endl(xostream& os) { return os.endl(); }
+xostream& endl(xostream& os) {
+    return os.endl();
+}
 
 void FileOutputStream::WriteStream(const void* bytes, ssize_t n) {
     std::fwrite(bytes, 1, static_cast<std::size_t>(n), m_file);
 }
 
-void FileOutputStream::FlushStream() { std::fflush(m_file); }
+void FileOutputStream::FlushStream() {
+    std::fflush(m_file);
+}
 
 }  // namespace tarn
