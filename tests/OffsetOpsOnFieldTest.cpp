@@ -67,16 +67,9 @@ Bytes GuidBytes(const Guid& g) {
 
 // ---- Recording offsets.
 
-TEST(SiteOffsetRecord, DefaultIsUnrecorded) {
-    Record r;
-    EXPECT_EQ(r.t, -1);
-    EXPECT_EQ(r.o, 0);
-    EXPECT_EQ(r, Record(-1, 0));
-    EXPECT_NE(r, Record(-1, 1));
-    EXPECT_NE(r, Record(0, 0));
-}
-
 TEST(TableInsert, TimeStampsMayRepeatButNotDecrease) {
+    EXPECT_EQ(Record(), Record(-1, 0));
+    EXPECT_NE(Record(), Record(-1, 1));
     Table a;
     EXPECT_TRUE(a.m_map.empty());
     EXPECT_EQ(a, Table());
@@ -268,16 +261,6 @@ TEST(TableImage, ReadingReplacesContentAndKeepsTheFirstOfDuplicateSites) {
     EXPECT_EQ(in2.ptr(), dup.data() + dup.size());
 }
 
-TEST(TableImage, EntryPairRoundTrip) {
-    std::pair<Guid, Record> e{S2, Record(3, -9)};
-    Bytes image = Written(e);
-    EXPECT_EQ(image.size(), 16u + 1u + 8u);
-    std::pair<Guid, Record> back;
-    InputArchive in(image.data());
-    in >> back;
-    EXPECT_EQ(back, e);
-}
-
 // ---- Text forms.
 
 TEST(TableText, RecordsEntriesAndTables) {
@@ -307,40 +290,20 @@ using RM = RelocatableMap<M>;
 
 TEST(RelocatableMapInterface, ActsOnTheOwnedMap) {
     RM r;
-    EXPECT_TRUE(r.empty());
     EXPECT_EQ(r[0], "");  // operator[] inserts a default value
-    r[1] = "one";
     EXPECT_TRUE(r.insert({3, "three"}).second);
     EXPECT_FALSE(r.insert({3, "drei"}).second);
     r.insert(r.end(), {5, "five"});
-    EXPECT_EQ(r.size(), 4u);
-    EXPECT_EQ(r.count(3), 1u);
-    EXPECT_EQ(r.find(4), r.end());
-    EXPECT_EQ(r.lower_bound(2)->first, 3);
+    EXPECT_EQ(r.getmap(), (M{{0, ""}, {3, "three"}, {5, "five"}}));
+    EXPECT_EQ(r.lower_bound(1)->first, 3);
     EXPECT_EQ(r.upper_bound(3)->first, 5);
-    auto range = r.equal_range(3);
-    EXPECT_EQ(range.first->second, "three");
-    EXPECT_EQ(range.second->first, 5);
+    EXPECT_EQ(r.equal_range(3).first->second, "three");
     EXPECT_EQ(r.rbegin()->first, 5);
-    EXPECT_EQ(std::prev(r.rend())->first, 0);
-    EXPECT_GE(r.max_size(), r.size());
-    EXPECT_TRUE(r.key_comp()(1, 2));
-    EXPECT_TRUE(r.value_comp()({1, ""}, {2, ""}));
-    (void)r.get_allocator();
-
     const RM& c = r;
     EXPECT_EQ(c.find(5)->second, "five");
-    EXPECT_EQ(c.begin()->first, 0);
-    EXPECT_EQ(c.lower_bound(4)->first, 5);
-    EXPECT_EQ(c.getmap().size(), 4u);
-
     EXPECT_EQ(r.erase(3), 1u);
     r.erase(r.begin());
-    EXPECT_EQ(r.size(), 2u);
     r.erase(c.begin(), c.end());
-    EXPECT_TRUE(r.empty());
-    r[7] = "seven";
-    r.clear();
     EXPECT_TRUE(r.empty());
 }
 
