@@ -34,8 +34,10 @@
 // - Faults: a missing directory (when it must exist), a directory that is not
 //   a store, a foreign or damaged file, permission problems and damaged
 //   records are all reported as RuntimeError naming the directory and, for a
-//   record, the identity. Misuse by the caller (writing identity 0, committing
-//   to a read-only store) asserts.
+//   record, the identity. The record frame guards the image bytes; LMDB's own
+//   page structure is LMDB's to check, and the damage it detects
+//   (MDB_CORRUPTED) arrives as a RuntimeError too. Misuse by the caller
+//   (writing identity 0, committing to a read-only store) asserts.
 
 #include <cstddef>
 #include <memory>
