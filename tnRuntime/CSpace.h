@@ -1,0 +1,203 @@
+#pragma once
+
+// An object space: the persistable objects of one store that are in memory,
+// and the changes to them that the next commit writes.
+//
+// Ownership. The space owns every object registered in it (DollarNew) or
+// loaded into it (by resolving a reference): these are its residents, keyed
+// by identity. References between objects own nothing. The space destroys
+// objects when a commit carries out their permanent deletion, when eviction
+// releases clean residents, and when the space itself is destroyed (which
+// discards uncommitted changes).
+//
+// Threads. A thread works in a space through a CSpaceGuard
+// (tnRuntime/CSpaceGuard.h), which takes the space's lock shared or
+// exclusive. Creating, changing, marking, deleting, committing and evicting
+// need the lock exclusively (checked by assertion); resolving references
+// works under either (shared holders resolve without binding, and loads are
+// serialised by an internal mutex).
+//
+// Identities come from a counter persisted in the store (1 in a new store);
+// RegisterGcObject hands out the next one at once.
+//
+// Commit writes, in one store transaction: the image of every queued (dirty)
+// object through its Serialise slot, with its class name from
+// GetReflectedClass()->m_name; the removal of every image queued for
+// permanent deletion (AsyncPermanentlyDeleteSubTree is expanded along
+// VisitPrefs at this point, loading as needed); the changed named roots; the
+// identity counter. Only after the store has accepted the batch are the
+// dirty flags cleared and the deleted objects destroyed; if anything throws
+// before, memory and store are as they were and the commit can be retried.
+//
+// Eviction (DropCleanResidents, EvictCleanResidents, or the resident bound
+// checked after each commit) releases clean residents, never dirty ones nor
+// ones queued for deletion: it first unbinds every reference to them held by
+// the remaining residents (walking their VisitObjects) and by SpaceRefs, so
+// that the next Get loads them again. Eviction and commit run only when the
+// caller invokes them, between operations, never inside one.
+//
+// Holding objects across eviction. A T* or a bound cref outside the space's
+// objects is not unbound by eviction and must not be kept across a commit or
+// an eviction. To keep an object, keep its identity or a named root and
+// resolve again, or keep a SpaceRef<T> (tnRuntime/SpaceRef.h), a reference
+// that the space tracks and unbinds like its residents' references.
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <shared_mutex>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+#include <vector>
+
+#include "tnPersistStore/IPersistable.h"
+#include "tnPersistStore/OID.h"
+#include "tnRuntime/IStore.h"
+
+namespace tarn {
+
+class prefbase;
+
+// Counts kept by a space, for tests, tools and benchmarks.
+struct CSpaceStats {
+    int64 numRegistered = 0;  // objects registered (DollarNew)
+    int64 numLoaded = 0;      // images loaded from the store
+    int64 numMarkCalls = 0;   // MarkPersistentAsDirtyWithoutTrace calls reaching the space
+    int64 numCommits = 0;
+    int64 numWritten = 0;  // images written by commits
+    int64 numDeleted = 0;  // objects permanently deleted by commits
+    int64 numEvicted = 0;  // clean residents released
+};
+
+// The link between a SpaceRef and its space; the space nulls `space` when it
+// goes away first.
+struct SpaceRefLink {
+    prefbase* ref = nullptr;
+    CSpace* space = nullptr;
+};
+
+class CSpace {
+public:
+    // A space over `store`; a new in-memory store when null.
+    explicit CSpace(std::shared_ptr<IStore> store = nullptr);
+    // Discards uncommitted changes and destroys every resident.
+    ~CSpace();
+    CSpace(const CSpace&) = delete;
+    CSpace& operator=(const CSpace&) = delete;
+
+    IStore& GetStore() const { return *m_store; }
+    const std::shared_ptr<IStore>& GetStorePtr() const { return m_store; }
+
+    // --- Objects (any lock) -------------------------------------------------
+
+    // The object `oid`: a resident, or loaded from the store and made
+    // resident. `expected` (null: any) is the class it must have. Throws
+    // RuntimeError when the store has no image of `oid`, the image's class is
+    // not registered or is not `expected`, or reading does not consume
+    // exactly the image.
+    ptr<IPersistable> Resolve(OID oid, const ReflectedClass* expected);
+    // The resident object `oid`, or null; never loads.
+    ptr<IPersistable> FindResident(OID oid) const;
+    bool IsResident(OID oid) const { return FindResident(oid).m_self != nullptr; }
+
+    ssize_t NumResidents() const;
+    ssize_t NumDirty() const { return static_cast<ssize_t>(m_dirty.size()); }
+    ssize_t NumQueuedDeletions() const { return static_cast<ssize_t>(m_deletions.size()); }
+    const CSpaceStats& Stats() const { return m_stats; }
+    // The identity the next registered object receives.
+    uint64 NextIdentity() const { return m_nextIdentity; }
+
+    // --- Creating (exclusive) -----------------------------------------------
+
+    // A new registered object of the registered class `className`, after
+    // its OnCreate(true). Throws RuntimeError for an unknown class.
+    ptr<IPersistable> CreateObject(std::string_view className);
+
+    // --- Named roots ----------------------------------------------------------
+
+    // Sets (a null identity: removes) a root; stored by the next commit.
+    // Exclusive.
+    void SetRoot(const std::string& name, OID oid);
+    void SetRoot(const std::string& name, const prefbase& ref);
+    // The root's identity, null when there is none.
+    OID GetRoot(std::string_view name) const;
+    std::map<std::string, OID> Roots() const;
+
+    // --- Commit and eviction (exclusive) --------------------------------------
+
+    void Commit();
+    // Releases every clean resident; returns how many.
+    ssize_t DropCleanResidents() { return EvictCleanResidents(0); }
+    // Releases clean residents, least recently loaded or registered first,
+    // until at most `maxResidents` remain or none is clean; returns how many.
+    ssize_t EvictCleanResidents(ssize_t maxResidents);
+    // After each commit, evict down to this many residents (0: no bound).
+    void SetResidentBound(ssize_t maxResidents) { m_residentBound = maxResidents; }
+
+    // --- Called by the runtime functions of tnPersistStore/IPersistable.h -----
+
+    void AdoptNew(ptr<IPersistable> obj);
+    void QueueDirty(ptr<IPersistable> obj);
+    void QueueDeletion(ptr<IPersistable> obj, bool subTree);
+    void Detach(ptr<IPersistable> obj);
+    void CountMarkCall() { ++m_stats.numMarkCalls; }
+
+    // --- SpaceRef tracking (any thread, any lock) ------------------------------
+
+    void AttachExternalRef(SpaceRefLink* link);
+    void DetachExternalRef(SpaceRefLink* link);
+
+private:
+    friend class CSpaceGuard;
+
+    struct Resident {
+        ptr<IPersistable> obj;
+        uint64 tick;  // load or registration order, for eviction
+    };
+    struct Deletion {
+        ptr<IPersistable> obj;
+        bool subTree;
+    };
+    using ObjectSet = std::unordered_set<const void*>;
+
+    void RequireExclusive() const;
+    ptr<IPersistable> Load(OID oid, const ReflectedClass* expected);
+    void ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet);
+    void UnbindReferencesTo(const ObjectSet& objects);
+    void DestroyDeleted(const std::vector<ptr<IPersistable>>& doomed);
+
+    std::shared_mutex m_lock;  // taken by CSpaceGuard
+    std::shared_ptr<IStore> m_store;
+
+    mutable std::mutex m_residentsMutex;  // loads under a shared lock
+    std::unordered_map<uint64, Resident> m_residents;
+    uint64 m_tick = 0;
+
+    std::vector<ptr<IPersistable>> m_dirty;  // objects whose DBP_PO_DIRTY is set
+    std::vector<Deletion> m_deletions;
+
+    uint64 m_nextIdentity = 1;
+    std::map<std::string, uint64, std::less<>> m_roots;  // current view, 0 entries removed
+    std::map<std::string, uint64> m_changedRoots;        // since the last commit
+
+    ssize_t m_residentBound = 0;
+    CSpaceStats m_stats;
+
+    std::mutex m_externalRefsMutex;
+    std::unordered_set<SpaceRefLink*> m_externalRefs;
+};
+
+// Creates a T with its default constructor, registers it in the thread's
+// space and calls its OnCreate(true): how the runtime makes a new object of
+// a class it knows (e.g. a new offset operations record, which creates its
+// map then).
+template <typename T>
+T* CreatePersistent() {
+    T* p = DollarNew(new T());
+    ptr<IPersistable>(p)->OnCreate(true);
+    return p;
+}
+
+}  // namespace tarn

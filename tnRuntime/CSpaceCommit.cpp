@@ -1,0 +1,149 @@
+// Commit: one store transaction with every queued change, then the in-memory
+// consequences (clean flags, destroyed deletions).
+
+#include <memory>
+
+#include "tnPersistStore/IPrefVisitor.h"
+#include "tnPersistStore/pref.h"
+#include "tnRuntime/CSpace.h"
+#include "tnUtils/Archive.h"
+#include "tnUtils/MemoryOutputStream.h"
+
+namespace tarn {
+
+namespace {
+
+// Collects the references an object reports along VisitPrefs.
+class PrefCollector final : public IPrefVisitor {
+public:
+    void VisitPref(const prefbase& ref) override {
+        if (ref) {
+            m_refs.push_back(&ref);
+        }
+    }
+    void VisitParentPref(const prefbase&) override {}
+
+    std::vector<const prefbase*> m_refs;
+};
+
+}  // namespace
+
+// The objects that the queued deletions remove: each queued object, and for
+// a subtree deletion everything below it along VisitPrefs (resolved, and so
+// loaded, as needed). Each object once.
+void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet) {
+    std::vector<ptr<IPersistable>> pending;
+    for (const Deletion& d : m_deletions) {
+        if (!doomedSet.insert(d.obj.m_self).second) {
+            if (!d.subTree) {
+                continue;
+            }
+        } else {
+            doomed.push_back(d.obj);
+        }
+        if (!d.subTree) {
+            continue;
+        }
+        pending.push_back(d.obj);
+        while (!pending.empty()) {
+            ptr<IPersistable> obj = pending.back();
+            pending.pop_back();
+            PrefCollector children;
+            obj->VisitPrefs(children);
+            for (const prefbase* ref : children.m_refs) {
+                ptr<IPersistable> child = ref->Get();
+                if (child->GetSysState().m_cspace != this) {
+                    continue;  // never registered: not the space's to delete
+                }
+                if (doomedSet.insert(child.m_self).second) {
+                    doomed.push_back(child);
+                    pending.push_back(child);
+                }
+            }
+        }
+    }
+}
+
+// Commit, in steps:
+//   1. expand the queued deletions (may load objects);
+//   2. serialise every dirty object that is not being deleted into the
+//      batch, with its class name;
+//   3. add the removals of deleted objects that have an image, the changed
+//      roots and the identity counter;
+//   4. hand the batch to the store as one transaction;
+//   5. only then: clear the written objects' flags, empty the queues, and
+//      destroy the deleted objects (after unbinding every reference to them).
+// An exception in steps 1-4 leaves the space and the store unchanged.
+void CSpace::Commit() {
+    RequireExclusive();
+
+    std::vector<ptr<IPersistable>> doomed;
+    ObjectSet doomedSet;
+    ExpandDeletions(doomed, doomedSet);
+
+    CommitBatch batch;
+    std::vector<ptr<IPersistable>> written;
+    batch.writes.reserve(m_dirty.size());
+    written.reserve(m_dirty.size());
+    MemoryOutputStream bytes;
+    auto ar = std::make_unique<Archive>(&bytes);
+    for (const ptr<IPersistable>& obj : m_dirty) {
+        if (doomedSet.count(obj.m_self) != 0) {
+            continue;
+        }
+        bytes.clear();
+        ar->ClearWriteBufferAndNumBytesWritten();
+        obj->Serialise(*ar);
+        ar->Flush();
+        StoredImage image{obj->GetReflectedClass()->m_name, bytes.bytes()};
+        batch.writes.emplace_back(obj->GetPersistObjState().m_oid.value_, std::move(image));
+        written.push_back(obj);
+    }
+    for (const ptr<IPersistable>& obj : doomed) {
+        if (!obj->GetSysState().GetFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT)) {
+            batch.deletes.push_back(obj->GetPersistObjState().m_oid.value_);
+        }
+    }
+    batch.roots = m_changedRoots;
+    batch.nextIdentity = m_nextIdentity;
+
+    m_store->Commit(batch);
+
+    for (const ptr<IPersistable>& obj : written) {
+        ObjSysState& state = obj->GetSysState();
+        state.ClearFlag(DBP_PO_DIRTY);
+        state.ClearFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT);
+    }
+    m_dirty.clear();
+    m_deletions.clear();
+    m_changedRoots.clear();
+    ++m_stats.numCommits;
+    m_stats.numWritten += static_cast<int64>(written.size());
+
+    if (!doomed.empty()) {
+        UnbindReferencesTo(doomedSet);
+        DestroyDeleted(doomed);
+    }
+    if (m_residentBound > 0) {
+        EvictCleanResidents(m_residentBound);
+    }
+}
+
+// Each deleted object is collected (its OnGarbageCollect slot takes it out of
+// the space) and destroyed.
+void CSpace::DestroyDeleted(const std::vector<ptr<IPersistable>>& doomed) {
+    for (const ptr<IPersistable>& obj : doomed) {
+        ObjSysState& state = obj->GetSysState();
+        state.ClearFlag(DBP_PO_DIRTY);
+        state.ClearFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+        state.SetFlag(DBP_PO_SYNC_DELETED);
+        obj->OnGarbageCollect();
+        if (state.m_cspace == this) {
+            Detach(obj);  // a class whose OnGarbageCollect does not report
+        }
+        obj->Destroy();
+        ++m_stats.numDeleted;
+    }
+}
+
+}  // namespace tarn

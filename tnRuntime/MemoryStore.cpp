@@ -1,0 +1,92 @@
+#include "tnRuntime/MemoryStore.h"
+
+#include <mutex>
+#include <vector>
+
+namespace tarn {
+
+std::optional<StoredImage> MemoryStore::Load(uint64 oid) {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    auto it = m_images.find(oid);
+    if (it == m_images.end()) {
+        return std::nullopt;
+    }
+    return it->second;
+}
+
+std::optional<uint64> MemoryStore::FindRoot(std::string_view name) {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    auto it = m_roots.find(name);
+    if (it == m_roots.end()) {
+        return std::nullopt;
+    }
+    return it->second;
+}
+
+std::map<std::string, uint64> MemoryStore::Roots() {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    return std::map<std::string, uint64>(m_roots.begin(), m_roots.end());
+}
+
+uint64 MemoryStore::NextIdentity() {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    return m_nextIdentity;
+}
+
+void MemoryStore::Commit(const CommitBatch& batch) {
+    // 1. Build everything that allocates: new image nodes and the new roots.
+    std::vector<std::map<uint64, StoredImage>::node_type> nodes;
+    nodes.reserve(batch.writes.size());
+    for (const auto& [oid, image] : batch.writes) {
+        std::map<uint64, StoredImage> one;
+        one.emplace(oid, image);
+        nodes.push_back(one.extract(one.begin()));
+    }
+    std::unique_lock<std::shared_mutex> lock(m_mutex);
+    std::map<std::string, uint64, std::less<>> roots = m_roots;
+    for (const auto& [name, oid] : batch.roots) {
+        roots[name] = oid;
+    }
+    // 2. Apply without allocating: relinking nodes and erasing cannot throw.
+    for (uint64 oid : batch.deletes) {
+        m_images.erase(oid);
+    }
+    for (auto& node : nodes) {
+        m_images.erase(node.key());
+        m_images.insert(std::move(node));
+    }
+    m_roots.swap(roots);
+    m_nextIdentity = batch.nextIdentity;
+    ++m_numCommits;
+}
+
+void MemoryStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
+    std::vector<uint64> oids;
+    {
+        std::shared_lock<std::shared_mutex> lock(m_mutex);
+        oids.reserve(m_images.size());
+        for (const auto& entry : m_images) {
+            oids.push_back(entry.first);
+        }
+    }
+    for (uint64 oid : oids) {
+        fn(oid);
+    }
+}
+
+StoreStats MemoryStore::Stats() {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    StoreStats stats;
+    stats.numImages = static_cast<ssize_t>(m_images.size());
+    for (const auto& [oid, image] : m_images) {
+        stats.numImageBytes += static_cast<ssize_t>(image.className.size() + image.bytes.size());
+    }
+    return stats;
+}
+
+ssize_t MemoryStore::NumCommits() {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    return m_numCommits;
+}
+
+}  // namespace tarn

@@ -1,0 +1,35 @@
+#pragma once
+
+// The in-memory store, the default store of a space: images, named roots and
+// the identity counter in ordinary containers. Thread-safe; Commit applies a
+// batch entirely or (when it throws, e.g. for lack of memory) not at all.
+
+#include <map>
+#include <shared_mutex>
+
+#include "tnRuntime/IStore.h"
+
+namespace tarn {
+
+class MemoryStore final : public IStore {
+public:
+    std::optional<StoredImage> Load(uint64 oid) override;
+    std::optional<uint64> FindRoot(std::string_view name) override;
+    std::map<std::string, uint64> Roots() override;
+    uint64 NextIdentity() override;
+    void Commit(const CommitBatch& batch) override;
+    void ForEachIdentity(const std::function<void(uint64)>& fn) override;
+    StoreStats Stats() override;
+
+    // Number of Commit calls that succeeded.
+    ssize_t NumCommits();
+
+private:
+    std::shared_mutex m_mutex;
+    std::map<uint64, StoredImage> m_images;
+    std::map<std::string, uint64, std::less<>> m_roots;
+    uint64 m_nextIdentity = 1;
+    ssize_t m_numCommits = 0;
+};
+
+}  // namespace tarn
