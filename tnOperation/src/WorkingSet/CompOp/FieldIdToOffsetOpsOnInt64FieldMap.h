@@ -214,9 +214,6 @@ public:
     void VisitPrefs(IPrefVisitor& v) const;
 
     // ---- Reflection and interfaces ----
-    static ptr<IObject> sfnCreateInstance();
-    AnyInterface QueryInterface(const ReflectedInterface& ri);
-    const ReflectedClass* GetReflectedClass() const;
 
     ssize_t m_size;
     cref<LeafNode> m_firstLeaf;
@@ -242,16 +239,5 @@ bool operator==(const std::pair<const FieldId, OffsetOpsOnField<int64>>& a,
                 const std::pair<const FieldId, OffsetOpsOnField<int64>>& b);
 bool operator!=(const std::pair<const FieldId, OffsetOpsOnField<int64>>& a,
                 const std::pair<const FieldId, OffsetOpsOnField<int64>>& b);
-
-// Reflection records (FieldIdToOffsetOpsOnInt64FieldMapReflection.cpp).
-const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMap*);
-const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMapInternalNode*);
-const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMapLeafNode*);
-const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMap*);
-const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapInternalNode*);
-const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapLeafNode*);
-void _Register_FieldIdToOffsetOpsOnInt64FieldMap();
-void _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode();
-void _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode();
 
 }  // namespace tarn

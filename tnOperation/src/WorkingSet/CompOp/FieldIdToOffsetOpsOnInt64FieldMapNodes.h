@@ -39,6 +39,24 @@ class Archive;
 class InputArchive;
 class IObjectVisitor;
 class IPrefVisitor;
+class FieldIdToOffsetOpsOnInt64FieldMap;
+class FieldIdToOffsetOpsOnInt64FieldMapInternalNode;
+class FieldIdToOffsetOpsOnInt64FieldMapLeafNode;
+
+// Reflection records, type operations and registration of the three classes
+// (FieldIdToOffsetOpsOnInt64FieldMapReflection.cpp). Declared ahead of the
+// classes so that every typed reference to them checks the class of what it
+// loads. QueryInterface, GetReflectedClass and sfnCreateInstance come with
+// the persistable mixin.
+const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMap*);
+const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMapInternalNode*);
+const ReflectedClass& _GetReflected(const FieldIdToOffsetOpsOnInt64FieldMapLeafNode*);
+const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMap*);
+const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapInternalNode*);
+const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapLeafNode*);
+void _Register_FieldIdToOffsetOpsOnInt64FieldMap();
+void _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode();
+void _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode();
 
 // Capacity and minimum fill of both node kinds. A node with MAX_ENTRIES is
 // full and splits on the next insertion that lands in it; a non-root node
@@ -137,11 +155,6 @@ public:
     void VisitObjects(IObjectVisitor& v) const;
     void VisitPrefs(IPrefVisitor& v) const;
 
-    // Reflection and interfaces.
-    static ptr<IObject> sfnCreateInstance();
-    AnyInterface QueryInterface(const ReflectedInterface& ri);
-    const ReflectedClass* GetReflectedClass() const;
-
     cref<void> m_ptr;
     ssize_t m_numKeyEntrys;
     alignas(Entry) octet_t m_entrys[MAX_ENTRIES * sizeof(Entry)];
@@ -171,10 +184,6 @@ public:
     void Deserialise(InputArchive& ar);
     void VisitObjects(IObjectVisitor& v) const;
     void VisitPrefs(IPrefVisitor& v) const;
-
-    static ptr<IObject> sfnCreateInstance();
-    AnyInterface QueryInterface(const ReflectedInterface& ri);
-    const ReflectedClass* GetReflectedClass() const;
 
     cref<FieldIdToOffsetOpsOnInt64FieldMapLeafNode> m_prev;
     cref<FieldIdToOffsetOpsOnInt64FieldMapLeafNode> m_next;
