@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <string>
 
+#include "tnOperation/RegisterClasses.h"
 #include "tnPersistStore/pref.h"
 #include "tnRuntime/ClassRegistry.h"
 #include "tnRuntime/MemoryStore.h"
@@ -37,6 +38,9 @@ void DiscardUnregistered(ptr<IPersistable> obj) {
 
 CSpace::CSpace(std::shared_ptr<IStore> store)
     : m_store(store != nullptr ? std::move(store) : std::make_shared<MemoryStore>()) {
+    // The library's own classes are registered once, before any space can
+    // load or create one of them by name.
+    RegisterOffsetOpsClasses();
     m_nextIdentity = m_store->NextIdentity();
     for (const auto& [name, oid] : m_store->Roots()) {
         if (oid != 0) {

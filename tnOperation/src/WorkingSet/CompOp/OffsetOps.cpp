@@ -38,11 +38,17 @@ void OffsetOps::Deserialise(InputArchive& ar) {
     ar >> m_map;
 }
 
-void OffsetOps::VisitObjects(IObjectVisitor& v) const { v << m_map; }
+void OffsetOps::VisitObjects(IObjectVisitor& v) const {
+    v << m_map;
+}
 
-void OffsetOps::VisitPrefs(IPrefVisitor& v) const { v << m_map; }
+void OffsetOps::VisitPrefs(IPrefVisitor& v) const {
+    v << m_map;
+}
 
-void OffsetOps::Write(xostream& os) const { os << static_cast<const prefbase&>(m_map); }
+void OffsetOps::Write(xostream& os) const {
+    os << static_cast<const prefbase&>(m_map);
+}
 
 xostream& operator<<(xostream& os, const OffsetOps& x) {
     x.Write(os);
@@ -56,12 +62,14 @@ void PrintVariable<OffsetOps>(xostream& os, const OffsetOps* p) {
 
 // Printable but neither copyable nor assignable through its type operations.
 const ReflectedClass& _GetReflected(const OffsetOps*) {
-    static const ReflectedClass record = MakePersistableReflectedClass<OffsetOps>(
-        "tarn::OffsetOps", PrintableTypeOps<OffsetOps>());
+    static const ReflectedClass record =
+        MakePersistableReflectedClass<OffsetOps>("tarn::OffsetOps", PrintableTypeOps<OffsetOps>());
     return record;
 }
 
-const TypeOps* _GetTypeOps(const OffsetOps*) { return &GetReflectedClass<OffsetOps>().m_ops; }
+const TypeOps* _GetTypeOps(const OffsetOps*) {
+    return &GetReflectedClass<OffsetOps>().m_ops;
+}
 
 // clang-format off
 void _Register_OffsetOps() {

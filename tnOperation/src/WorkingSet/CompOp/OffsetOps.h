@@ -15,11 +15,11 @@
 //   schema   varint      always 1
 //   m_map    8 bytes     identity of the map object, little-endian
 
+#include "tnObject/TypeOps.h"
 #include "tnOperation/FieldId.h"
 #include "tnOperation/src/Util/Opid.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
-#include "tnObject/TypeOps.h"
 #include "tnPersistStore/btreemap.h"
 
 namespace tarn {
