@@ -1,0 +1,97 @@
+#pragma once
+
+// Small persistable classes for the object model and runtime tests, with
+// their own reflection records, registered in the "tests" target.
+//
+// TestNode image:
+//   schema    varint   1
+//   m_value   8 bytes  little-endian
+//   m_left    8 bytes  identity, 0 when empty
+//   m_right   8 bytes  identity
+// Both references are tree edges (VisitObjects and VisitPrefs report them).
+//
+// TestOther image: schema 1, then m_value (8 bytes).
+
+#include "tnObject/IObject.h"
+#include "tnObject/IObjectVisitor.h"
+#include "tnPersistStore/IPersistable.h"
+#include "tnPersistStore/IPrefVisitor.h"
+#include "tnPersistStore/PersistableReflection.h"
+#include "tnPersistStore/pref.h"
+#include "tnRuntime/ClassRegistry.h"
+#include "tnUtils/Archive.h"
+#include "tnUtils/Assert.h"
+
+namespace tarn::testing {
+
+class TestNode : public PersistableMixin<IObjectBaseMixin<TestNode, EmptyBase>> {
+public:
+    TestNode() { ++s_live; }
+    explicit TestNode(int64 value) : m_value(value) { ++s_live; }
+    TestNode(const TestNode& rhs)
+        : PersistableMixin(rhs), m_value(rhs.m_value), m_left(rhs.m_left), m_right(rhs.m_right) {
+        ++s_live;
+    }
+    TestNode& operator=(const TestNode&) = default;
+    ~TestNode() { --s_live; }
+
+    void VisitObjects(IObjectVisitor& v) const { v << m_left << m_right; }
+    void VisitPrefs(IPrefVisitor& v) const { v << m_left << m_right; }
+    void Serialise(Archive& ar) const {
+        SerialiseSchema(ar, 1);
+        ar << m_value << m_left << m_right;
+    }
+    void Deserialise(InputArchive& ar) {
+        schema_t schema;
+        DeserialiseSchema(ar, 1, schema);
+        ar >> m_value >> m_left >> m_right;
+    }
+    void OnCreate(bool local) { m_onCreateArg = local ? 1 : 0; }
+
+    int64 m_value = 0;
+    cref<TestNode> m_left;
+    cref<TestNode> m_right;
+    int m_onCreateArg = -1;  // not stored: -1 until OnCreate runs
+
+    static inline int s_live = 0;  // instances alive
+};
+
+class TestOther : public PersistableMixin<IObjectBaseMixin<TestOther, EmptyBase>> {
+public:
+    void Serialise(Archive& ar) const {
+        SerialiseSchema(ar, 1);
+        ar << m_value;
+    }
+    void Deserialise(InputArchive& ar) {
+        schema_t schema;
+        DeserialiseSchema(ar, 1, schema);
+        ar >> m_value;
+    }
+
+    int64 m_value = 0;
+};
+
+inline const ReflectedClass& _GetReflected(const TestNode*) {
+    static const ReflectedClass record = MakePersistableReflectedClass<TestNode>(
+        "tarn::testing::TestNode", CopyableTypeOps<TestNode>());
+    return record;
+}
+
+inline const ReflectedClass& _GetReflected(const TestOther*) {
+    static const ReflectedClass record = MakePersistableReflectedClass<TestOther>(
+        "tarn::testing::TestOther", CopyableTypeOps<TestOther>());
+    return record;
+}
+
+// Registers both classes once per process.
+inline void RegisterTestClasses() {
+    static const bool registered = [] {
+        XTarget* target = GetXTarget("tests");
+        TARN_ASSERT(RegisterReflectedClass(&_GetReflected((TestNode*)0), target) == NSE_OK);
+        TARN_ASSERT(RegisterReflectedClass(&_GetReflected((TestOther*)0), target) == NSE_OK);
+        return true;
+    }();
+    (void)registered;
+}
+
+}  // namespace tarn::testing
