@@ -18,12 +18,18 @@
 
 #include <gtest/gtest.h>
 
+#include <memory>
 #include <sstream>
 #include <string>
 #include <vector>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
+#include "tnRuntime/CSpace.h"
+#include "tnRuntime/CSpaceGuard.h"
+#include "tnRuntime/ClassRegistry.h"
+#include "tnRuntime/MemoryStore.h"
+#include "tnRuntime/RuntimeCallLog.h"
 
 namespace tarn::testing {
 
@@ -237,6 +243,95 @@ inline std::vector<ssize_t> LeafCounts(const FieldIdToOffsetOpsOnInt64FieldMap& 
     }
     return counts;
 }
+
+// ---- Runtime helpers ---------------------------------------------------------
+
+// Registers the three tree classes once per process, so that their images can
+// be loaded by class name.
+inline void RegisterBTreeClasses() {
+    if (FindReflectedClass("tarn::FieldIdToOffsetOpsOnInt64FieldMap") == nullptr) {
+        _Register_FieldIdToOffsetOpsOnInt64FieldMap();
+        _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode();
+        _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode();
+    }
+}
+
+// An in-memory store that remembers the identities each commit wrote, in the
+// order the space queued them: registration of a new object or the first
+// dirty mark since the previous commit. That order makes the sequence of dirty
+// marks of one operation observable.
+class RecordingStore final : public IStore {
+public:
+    std::optional<StoredImage> Load(uint64 oid) override { return m_store.Load(oid); }
+    std::optional<uint64> FindRoot(std::string_view name) override {
+        return m_store.FindRoot(name);
+    }
+    std::map<std::string, uint64> Roots() override { return m_store.Roots(); }
+    uint64 NextIdentity() override { return m_store.NextIdentity(); }
+    void Commit(const CommitBatch& batch) override {
+        m_lastWrites.clear();
+        for (const auto& w : batch.writes) {
+            m_lastWrites.push_back(w.first);
+        }
+        m_lastDeletes = batch.deletes;
+        m_store.Commit(batch);
+    }
+    void ForEachIdentity(const std::function<void(uint64)>& fn) override {
+        m_store.ForEachIdentity(fn);
+    }
+    StoreStats Stats() override { return m_store.Stats(); }
+
+    std::vector<uint64> m_lastWrites;
+    std::vector<uint64> m_lastDeletes;
+
+private:
+    MemoryStore m_store;
+};
+
+template <typename T>
+uint64 Oid(const T* obj) {
+    return obj->GetPersistObjState().m_oid.value_;
+}
+
+// A space over a recording store, held exclusively by the test's thread, with
+// one registered map in it.
+class BTreeSpaceTest : public ::testing::Test {
+protected:
+    using Map = FieldIdToOffsetOpsOnInt64FieldMap;
+    using Leaf = FieldIdToOffsetOpsOnInt64FieldMapLeafNode;
+    using Internal = FieldIdToOffsetOpsOnInt64FieldMapInternalNode;
+
+    BTreeSpaceTest()
+        : m_store(std::make_shared<RecordingStore>()),
+          m_space(m_store),
+          m_guard(m_space, LockMode::Exclusive) {
+        RegisterBTreeClasses();
+        m_map = DollarNew(new Map());
+        GetThreadRuntimeCallLog() = RuntimeCallLog();
+    }
+
+    Map& map() { return *m_map; }
+
+    // Writes everything queued so far and starts a fresh call log, so that
+    // the next operation's marks and calls can be observed on their own.
+    void Commit() {
+        m_space.Commit();
+        GetThreadRuntimeCallLog() = RuntimeCallLog();
+    }
+
+    // The identities written by the next commit, in queue order.
+    std::vector<uint64> CommitAndListWrites() {
+        m_space.Commit();
+        return m_store->m_lastWrites;
+    }
+
+    RuntimeCallLog& Log() { return GetThreadRuntimeCallLog(); }
+
+    std::shared_ptr<RecordingStore> m_store;
+    CSpace m_space;
+    CSpaceGuard m_guard;
+    Map* m_map = nullptr;
+};
 
 }  // namespace tarn::testing
 
