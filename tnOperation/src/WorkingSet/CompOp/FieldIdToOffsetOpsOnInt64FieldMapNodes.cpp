@@ -14,7 +14,9 @@ using InternalNode = FieldIdToOffsetOpsOnInt64FieldMapInternalNode;
 using LeafNode = FieldIdToOffsetOpsOnInt64FieldMapLeafNode;
 using LeafEntry = FieldIdToOffsetOpsOnInt64FieldMapLeafKeyEntry;
 
-// Copy-constructs rhs's live entries into the raw slots of `node`.
+// Copy-constructs rhs's live entries into the raw slots of `node`, counting
+// each one as soon as it is whole, so that a failure part-way leaves exactly
+// the counted entries to destroy.
 void CopyInternalEntries(InternalNode* node, const InternalNode& rhs) {
     for (ssize_t i = 0; i < rhs.m_numKeyEntrys; ++i) {
         CopyConstructInternalEntry(node, i, rhs.GetEntry(i));
@@ -39,7 +41,12 @@ void CopyLeafEntries(LeafNode* node, const LeafNode& rhs) {
 
 InternalNode::FieldIdToOffsetOpsOnInt64FieldMapInternalNode(const InternalNode& rhs)
     : PersistableMixin(rhs), m_ptr(rhs.m_ptr), m_numKeyEntrys(0) {
-    CopyInternalEntries(this, rhs);
+    try {
+        CopyInternalEntries(this, rhs);
+    } catch (...) {
+        DestructArrayElements(&GetEntry(0), m_numKeyEntrys);
+        throw;
+    }
 }
 
 InternalNode& InternalNode::operator=(const InternalNode& rhs) {
@@ -116,7 +123,12 @@ ssize_t InternalNode::FindChildIndexGivenKey(const FieldId& key) const {
 
 LeafNode::FieldIdToOffsetOpsOnInt64FieldMapLeafNode(const LeafNode& rhs)
     : PersistableMixin(rhs), m_prev(rhs.m_prev), m_next(rhs.m_next), m_numKeyEntrys(0) {
-    CopyLeafEntries(this, rhs);
+    try {
+        CopyLeafEntries(this, rhs);
+    } catch (...) {
+        DestructArrayElements(&GetEntry(0), m_numKeyEntrys);
+        throw;
+    }
 }
 
 LeafNode& LeafNode::operator=(const LeafNode& rhs) {
