@@ -133,7 +133,9 @@ public:
     // Releases clean residents, least recently loaded or registered first,
     // until at most `maxResidents` remain or none is clean; returns how many.
     ssize_t EvictCleanResidents(ssize_t maxResidents);
-    // After each commit, evict down to this many residents (0: no bound).
+    // After each commit that leaves more than `maxResidents` residents,
+    // evict down to three quarters of it (0: no bound). The slack keeps the
+    // unbinding walk over all residents from running at every commit.
     void SetResidentBound(ssize_t maxResidents) { m_residentBound = maxResidents; }
 
     // --- Called by the runtime functions of tnPersistStore/IPersistable.h -----

@@ -124,8 +124,8 @@ void CSpace::Commit() {
         UnbindReferencesTo(doomedSet);
         DestroyDeleted(doomed);
     }
-    if (m_residentBound > 0) {
-        EvictCleanResidents(m_residentBound);
+    if (m_residentBound > 0 && NumResidents() > m_residentBound) {
+        EvictCleanResidents(m_residentBound - m_residentBound / 4);
     }
 }
 
