@@ -642,7 +642,8 @@ protected:
     }
 
     // Counts since the last commit; the dropped nodes must be queued, and
-    // the commit destroys exactly them.
+    // the commit destroys exactly them. Every `m_evictEvery` commits, the
+    // whole tree is evicted.
     void CommitAndCheck() {
         const int64 dropped = Log().numAsyncDeleteObject - m_droppedAtCommit;
         ASSERT_EQ(m_space.NumQueuedDeletions(), dropped);
@@ -651,6 +652,15 @@ protected:
         ASSERT_EQ(m_space.Stats().numDeleted - deletedBefore, dropped);
         ASSERT_EQ(m_space.NumQueuedDeletions(), 0);
         m_droppedAtCommit = Log().numAsyncDeleteObject;
+        if (m_evictEvery > 0 && ++m_commits % m_evictEvery == 0) {
+            // Release every clean resident, the header included, so that the
+            // next operations load the nodes they touch (neighbours too).
+            const OID mapId = IdOf(m_map);
+            m_space.DropCleanResidents();
+            ASSERT_FALSE(m_space.IsResident(mapId));
+            m_map = static_cast<Map*>(m_space.Resolve(mapId, nullptr).m_self);
+            ASSERT_NE(m_map, nullptr);
+        }
     }
 
     void Put(uint64 num, int64 value) {
@@ -690,9 +700,10 @@ protected:
     }
 
     // Deletes every key of the model in `order`, then expects the empty root
-    // leaf, which is the map's first leaf of before.
+    // leaf, which is the map's first leaf of before (deletion keeps the left
+    // node of every merge).
     void DeleteAll(const Keys& order, int checkEvery, int commitEvery) {
-        Leaf* first = map().m_firstLeaf.Get();
+        const OID first = IdOf(map().m_firstLeaf.Get());
         int op = 0;
         for (uint64 num : order) {
             ASSERT_NO_FATAL_FAILURE(Remove(num));
@@ -707,9 +718,10 @@ protected:
         ASSERT_NO_FATAL_FAILURE(CheckAll());
         EXPECT_EQ(map().m_height, 0);
         EXPECT_EQ(map().m_size, 0);
-        EXPECT_EQ(map().m_root.Get(), first);
-        EXPECT_EQ(first->m_numKeyEntrys, 0);
+        EXPECT_EQ(IdOf(AsLeaf(map().m_root.Get())), first);
+        EXPECT_EQ(AsLeaf(map().m_root.Get())->m_numKeyEntrys, 0);
         EXPECT_EQ(map().GetNumNodes(), 1);
+        m_evictEvery = 0;
         ASSERT_NO_FATAL_FAILURE(CommitAndCheck());
         EXPECT_EQ(m_space.NumResidents(), 2);  // the header and the root leaf
     }
@@ -732,6 +744,8 @@ protected:
 
     Model m_model;
     int64 m_droppedAtCommit = 0;
+    int m_evictEvery = 0;
+    int m_commits = 0;
 };
 
 TEST_F(BTreeModel, SmallTreesCheckedAfterEveryStep) {
@@ -758,6 +772,7 @@ TEST_F(BTreeModel, TreeGrowsToHeight2AndShrinksBack) {
 
 TEST_F(BTreeModel, LargeTreeRandomWalk) {
     std::mt19937_64 rng(12);
+    m_evictEvery = 4;
     ASSERT_NO_FATAL_FAILURE(RandomWalk(rng, 200000, 60000, 75, 20000, 5000));
     ASSERT_EQ(map().m_height, 2);
     ASSERT_NO_FATAL_FAILURE(RandomWalk(rng, 200000, 60000, 50, 20000, 5000));
@@ -788,6 +803,7 @@ TEST_F(BTreeModel, DeleteEveryKeyInRandomOrder) {
 // Height 3 (about 260,000 keys): internal nodes then have cousins, and an
 // internal balance can rotate through an anchor above both parents.
 TEST_F(BTreeModel, DeleteEveryKeyOfHeight3TreeInRandomOrder) {
+    m_evictEvery = 4;
     ASSERT_NO_FATAL_FAILURE(FillModel(265000));
     ASSERT_EQ(map().m_height, 3);
     Keys order = ModelKeys();
