@@ -1,0 +1,243 @@
+#include "tools/OpsFile.h"
+
+#include <charconv>
+#include <vector>
+
+#include "tnUtils/xostream.h"
+
+namespace tarn::tool {
+
+namespace {
+
+std::string_view Trim(std::string_view s) {
+    const char* blanks = " \t\r";
+    std::size_t first = s.find_first_not_of(blanks);
+    if (first == std::string_view::npos) {
+        return {};
+    }
+    std::size_t last = s.find_last_not_of(blanks);
+    return s.substr(first, last - first + 1);
+}
+
+std::string Quoted(std::string_view s) {
+    return "'" + std::string(s) + "'";
+}
+
+int HexDigit(char c) {
+    if (c >= '0' && c <= '9') {
+        return c - '0';
+    }
+    if (c >= 'a' && c <= 'f') {
+        return c - 'a' + 10;
+    }
+    if (c >= 'A' && c <= 'F') {
+        return c - 'A' + 10;
+    }
+    return -1;
+}
+
+// A decimal integer filling all of `s`; std::errc{} on success,
+// invalid_argument or result_out_of_range otherwise.
+template <typename Int>
+std::errc ParseDecimal(std::string_view s, Int& value) {
+    if (s.size() > 1 && s[0] == '+') {
+        s.remove_prefix(1);
+    }
+    if (s.empty()) {
+        return std::errc::invalid_argument;
+    }
+    auto [end, ec] = std::from_chars(s.data(), s.data() + s.size(), value);
+    if (ec == std::errc{} && end != s.data() + s.size()) {
+        return std::errc::invalid_argument;
+    }
+    return ec;
+}
+
+bool ParseTimeStamp(std::string_view s, int64& t, std::string& error) {
+    if (s.empty()) {
+        error = "the time stamp is missing";
+        return false;
+    }
+    std::errc ec = ParseDecimal(s, t);
+    if (ec == std::errc::invalid_argument) {
+        error = "time stamp " + Quoted(s) + " is not a decimal integer";
+        return false;
+    }
+    if (ec == std::errc::result_out_of_range || t < 0 || t > kMaxTimeStamp) {
+        error = "time stamp " + std::string(s) + " is outside 0.." + std::to_string(kMaxTimeStamp) +
+                " (time stamps are stored as 32-bit values)";
+        return false;
+    }
+    return true;
+}
+
+bool ParseOid(std::string_view s, uint64& oid, std::string& error) {
+    if (s.empty()) {
+        error = "the oid is missing";
+        return false;
+    }
+    if (s[0] == '-' || s[0] == '+') {
+        error = "oid " + Quoted(s) + " is not an unsigned decimal integer";
+        return false;
+    }
+    std::errc ec = ParseDecimal(s, oid);
+    if (ec == std::errc::invalid_argument) {
+        error = "oid " + Quoted(s) + " is not an unsigned decimal integer";
+        return false;
+    }
+    if (ec == std::errc::result_out_of_range) {
+        error = "oid " + std::string(s) + " does not fit in 64 bits";
+        return false;
+    }
+    if (oid == 0) {
+        error = "oid 0 names no object (identities start at 1)";
+        return false;
+    }
+    return true;
+}
+
+bool ParsePath(std::string_view s, Path& path, std::string& error) {
+    if (s.size() % 2 != 0) {
+        error = "path " + Quoted(s) + " has an odd number of hex digits";
+        return false;
+    }
+    std::vector<octet_t> bytes;
+    bytes.reserve(s.size() / 2);
+    for (std::size_t i = 0; i < s.size(); i += 2) {
+        int hi = HexDigit(s[i]);
+        int lo = HexDigit(s[i + 1]);
+        if (hi < 0 || lo < 0) {
+            error = "path " + Quoted(s) + " is not hex (two hex digits a byte)";
+            return false;
+        }
+        bytes.push_back(static_cast<octet_t>(hi * 16 + lo));
+    }
+    path = Path(bytes.data(), static_cast<ssize_t>(bytes.size()));
+    return true;
+}
+
+bool ParseOffset(std::string_view s, int64& offset, std::string& error) {
+    if (s.empty()) {
+        error = "the offset is missing";
+        return false;
+    }
+    std::errc ec = ParseDecimal(s, offset);
+    if (ec == std::errc::invalid_argument) {
+        error = "offset " + Quoted(s) + " is not a signed decimal integer";
+        return false;
+    }
+    if (ec == std::errc::result_out_of_range) {
+        error = "offset " + std::string(s) + " does not fit in 64 bits";
+        return false;
+    }
+    return true;
+}
+
+}  // namespace
+
+std::string FieldIdText(const FieldId& fid) {
+    StringOutputStream text;
+    {
+        xostream os(text);
+        os << fid;
+    }
+    return text.str();
+}
+
+std::string FormatOpsLine(const OffsetOperation& op) {
+    StringOutputStream path;
+    {
+        xostream os(path);
+        os << op.field.path;
+    }
+    return ToString(op.site) + "," + std::to_string(op.t) + "," +
+           std::to_string(op.field.oid.value_) + "," + path.str() + "," + std::to_string(op.offset);
+}
+
+ParsedLine ParseOpsLine(std::string_view line) {
+    ParsedLine parsed;
+    line = Trim(line.substr(0, line.find('#')));
+    if (line.empty()) {
+        return parsed;
+    }
+    std::vector<std::string_view> fields;
+    for (std::size_t start = 0;;) {
+        std::size_t comma = line.find(',', start);
+        fields.push_back(Trim(line.substr(start, comma - start)));
+        if (comma == std::string_view::npos) {
+            break;
+        }
+        start = comma + 1;
+    }
+    parsed.kind = ParsedLine::Kind::Error;
+    if (fields.size() != 5) {
+        parsed.error = "expected 5 comma-separated fields (site,t,oid,path,offset), found " +
+                       std::to_string(fields.size());
+        return parsed;
+    }
+    std::optional<Guid> site = ParseGuid(fields[0]);
+    if (!site) {
+        parsed.error = "site " + Quoted(fields[0]) +
+                       " is not a Guid (8-4-4-4-12 hex digits, e.g. "
+                       "0123abcd-0000-4000-8000-00000000002a)";
+        return parsed;
+    }
+    OffsetOperation& op = parsed.op;
+    op.site = *site;
+    uint64 oid = 0;
+    Path path;
+    if (!ParseTimeStamp(fields[1], op.t, parsed.error) || !ParseOid(fields[2], oid, parsed.error) ||
+        !ParsePath(fields[3], path, parsed.error) ||
+        !ParseOffset(fields[4], op.offset, parsed.error)) {
+        return parsed;
+    }
+    op.field = FieldId(OID(Seid(oid)), path);
+    parsed.kind = ParsedLine::Kind::Operation;
+    return parsed;
+}
+
+std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error) {
+    std::string message;
+    std::string_view s = Trim(text);
+    if (!s.empty() && s[0] == '#') {
+        s.remove_prefix(1);
+    }
+    std::size_t slash = s.find('/');
+    std::string_view oidText = s.substr(0, slash);
+    std::string_view pathText = slash == std::string_view::npos ? "" : s.substr(slash + 1);
+    uint64 oid = 0;
+    Path path;
+    if (!ParseOid(oidText, oid, message) || !ParsePath(pathText, path, message)) {
+        if (error != nullptr) {
+            *error =
+                "field " + Quoted(text) + ": " + message + " (expected OID/PATH, e.g. #12/0a0b)";
+        }
+        return std::nullopt;
+    }
+    return FieldId(OID(Seid(oid)), path);
+}
+
+OpsFileReader::Status OpsFileReader::Next(OffsetOperation& op, std::string& error) {
+    while (std::getline(m_in, m_buffer)) {
+        ++m_line;
+        ParsedLine parsed = ParseOpsLine(m_buffer);
+        switch (parsed.kind) {
+            case ParsedLine::Kind::Nothing:
+                continue;
+            case ParsedLine::Kind::Operation:
+                op = std::move(parsed.op);
+                return Status::Operation;
+            case ParsedLine::Kind::Error:
+                error = std::move(parsed.error);
+                return Status::Error;
+        }
+    }
+    if (m_in.bad()) {
+        ++m_line;
+        error = "read error";
+        return Status::Error;
+    }
+    return Status::End;
+}
+
+}  // namespace tarn::tool

@@ -1,0 +1,90 @@
+#pragma once
+
+// The text form of offset operations read by `offsetops record --ops FILE`.
+//
+// One operation a line, five comma-separated fields:
+//
+//   site,t,oid,path,offset
+//
+//   site    the site's Guid, 8-4-4-4-12 hex digits ("0123abcd-0000-4000-8000-00000000002a")
+//   t       the operation's time stamp, decimal, 0..4294967295 (stored as 32 bits)
+//   oid     the object's identity, decimal, 1..18446744073709551615 (0 is no object)
+//   path    the field's path inside the object, hex, two digits a byte; may be empty
+//   offset  the offset, signed decimal, 64 bits
+//
+// Spaces and tabs around a field are ignored, and so is a carriage return at
+// the end of a line. A '#' starts a comment that runs to the end of the line;
+// a line holding nothing but a comment or blanks is skipped.
+//
+// Everything here only parses: nothing checks an operation against what a
+// store already holds (tools/Recorder.h does that).
+
+#include <istream>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "tnOperation/FieldId.h"
+#include "tnUtils/Guid.h"
+#include "tnUtils/Types.h"
+
+namespace tarn::tool {
+
+// The largest time stamp an image can hold: time stamps are written as
+// variable-length integers that carry 32 bits.
+constexpr int64 kMaxTimeStamp = 4294967295;
+
+// One offset operation: `offset` added to field `field` by site `site` at
+// time stamp `t`.
+struct OffsetOperation {
+    Guid site{};
+    int64 t = 0;
+    FieldId field;
+    int64 offset = 0;
+};
+
+// The line form above, without a line break; ParseOpsLine reads it back.
+std::string FormatOpsLine(const OffsetOperation& op);
+
+// The outcome of parsing one line.
+struct ParsedLine {
+    enum class Kind { Operation, Nothing, Error };
+    Kind kind = Kind::Nothing;
+    OffsetOperation op;  // for Operation
+    std::string error;   // for Error: what is wrong, without file or line
+};
+
+ParsedLine ParseOpsLine(std::string_view line);
+
+// A field key in the text form of FieldId ("#12/0a0b"): an optional '#', the
+// decimal identity, then '/' and the path in hex. "12" alone means the empty
+// path. Nothing, with a message in `error`, when the text is not one.
+std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error);
+
+// The text form of a key, as FieldId prints it ("#12/0a0b").
+std::string FieldIdText(const FieldId& fid);
+
+// Reads operations from a stream line by line, skipping blanks and comments.
+// Not thread-safe; owns nothing but its line buffer.
+class OpsFileReader {
+public:
+    enum class Status { Operation, End, Error };
+
+    OpsFileReader(std::istream& in, std::string name) : m_in(in), m_name(std::move(name)) {}
+
+    // The next operation into `op`; on Error, `error` says what is wrong with
+    // line LineNumber(). After End or Error, do not call again.
+    Status Next(OffsetOperation& op, std::string& error);
+
+    // The number of the line read last (1 for the first line).
+    int64 LineNumber() const { return m_line; }
+    const std::string& Name() const { return m_name; }
+
+private:
+    std::istream& m_in;
+    std::string m_name;
+    std::string m_buffer;
+    int64 m_line = 0;
+};
+
+}  // namespace tarn::tool
