@@ -1,11 +1,15 @@
 #include "tnPersistStore/OID.h"
 
+#include <cstdio>
+
 #include "tnUtils/xostream.h"
 
 namespace tarn {
 
 std::string ToString(const OID& oid) {
-    return "#" + std::to_string(oid.value_);
+    char text[24];
+    int n = std::snprintf(text, sizeof text, "#%llu", static_cast<unsigned long long>(oid.value_));
+    return std::string(text, static_cast<std::size_t>(n));
 }
 
 xostream& operator<<(xostream& os, const OID& oid) {
