@@ -1,5 +1,6 @@
 #include "tools/Commands.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -365,9 +366,13 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
     Row(out, "images",
         std::to_string(reach.stored) + " (" + std::to_string(reach.reached) +
             " reached from roots)");
+    // Objects the tree check could not load are reported once.
     for (const std::string& e : reach.errors) {
-        problems.push_back(e);
-        ++numProblems;
+        if (std::none_of(problems.begin(), problems.end(),
+                         [&](const std::string& p) { return p.find(e) != std::string::npos; })) {
+            problems.push_back(e);
+            ++numProblems;
+        }
     }
     if (!reach.unreachable.empty()) {
         std::string list;
@@ -378,7 +383,11 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
             list += ", ...";
         }
         problems.push_back(std::to_string(reach.unreachable.size()) +
-                           " images that no root reaches: " + list);
+                           " images that no root reaches" +
+                           (reach.errors.empty() ? ""
+                                                 : " (or that lie below objects that could not "
+                                                   "be read)") +
+                           ": " + list);
         ++numProblems;
     }
     for (const std::string& p : problems) {

@@ -69,7 +69,7 @@ private:
     // cannot be loaded or has another class.
     void* Load(const prefbase& ref, const ReflectedClass& rc, const char* what) {
         if (!ref) {
-            Problem(std::string("a missing reference where ") + what + " should be");
+            Problem(std::string("a missing reference where a ") + what + " should be");
             return nullptr;
         }
         try {
@@ -93,7 +93,7 @@ private:
             return;
         }
         auto* node = static_cast<InternalNode*>(
-            Load(ref, GetReflectedClass<InternalNode>(), "the internal node"));
+            Load(ref, GetReflectedClass<InternalNode>(), "internal node"));
         if (node == nullptr) {
             return;
         }
@@ -115,7 +115,7 @@ private:
     }
 
     void Leaf(const prefbase& ref, bool isRoot, const FieldId* lo, const FieldId* hi) {
-        auto* leaf = static_cast<LeafNode*>(Load(ref, GetReflectedClass<LeafNode>(), "the leaf"));
+        auto* leaf = static_cast<LeafNode*>(Load(ref, GetReflectedClass<LeafNode>(), "leaf"));
         if (leaf == nullptr) {
             return;
         }
