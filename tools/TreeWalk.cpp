@@ -24,7 +24,7 @@ uint64 Child(const prefbase& ref, uint64 parent) {
 }  // namespace
 
 void KeepResidentsUnder(CSpace& space, ssize_t bound) {
-    if (bound > 0 && space.NumResidents() > bound) {
+    if (bound > 0 && space.NumResidents() >= bound) {
         space.EvictCleanResidents(bound / 2);
     }
 }

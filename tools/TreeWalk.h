@@ -5,10 +5,11 @@
 //
 // The walk goes level by level from the root and keeps only identities
 // between nodes, never pointers, so it may evict after every node: whenever
-// more than `bound` objects are resident it releases clean ones (down to half
-// the bound). Each node is loaded with the class its level requires; an image
-// of another class, a missing image or a missing child reference ends the
-// walk with a RuntimeError. The walk checks nothing else (see TreeCheck.h).
+// `bound` objects are resident it releases clean ones (down to half the
+// bound), so that loading the next node keeps within the bound. Each node
+// is loaded with the class its level requires; an image of another class, a
+// missing image or a missing child reference ends the walk with a
+// RuntimeError. The walk checks nothing else (see TreeCheck.h).
 //
 // Run it holding the map's space: exclusively when bound > 0 (eviction needs
 // it), with either lock otherwise. Leaves are visited in key order.
@@ -34,7 +35,7 @@ using LeafVisitor = std::function<void(const FieldIdToOffsetOpsOnInt64FieldMapLe
 // `onLeaf` may be empty. The leaf it receives is valid only during the call.
 TreeShape WalkTree(CSpace& space, OID mapOid, ssize_t bound, const LeafVisitor& onLeaf);
 
-// Evicts clean residents down to bound/2 when more than `bound` (> 0) are
+// Evicts clean residents down to bound/2 when `bound` (> 0) or more are
 // resident. Needs the space exclusively.
 void KeepResidentsUnder(CSpace& space, ssize_t bound);
 
