@@ -273,16 +273,19 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
             where = position();
         }
     } catch (const RuntimeError& e) {
-        error = e.what();
-        where = generator || reader ? position() : "before the first operation";
+        // An error of the store in the middle of an operation may leave the
+        // tree in memory half changed: nothing more is committed.
+        progress.Finish();
+        const std::string at = generator || reader ? position() : "before the first operation";
+        return Fail(err, at + ": " + e.what() + "; stopped there: the " +
+                             std::to_string(recorder.Committed()) +
+                             " operations of this run committed before it are kept, the " +
+                             std::to_string(recorder.Recorded() - recorder.Committed()) +
+                             " recorded since are not");
     }
     if (!error.empty()) {
-        // Keep everything before the stopping input.
-        try {
-            recorder.Commit();
-        } catch (const RuntimeError& e) {
-            error += std::string("; committing what came before failed as well: ") + e.what();
-        }
+        // Refused input never reached the tree: keep everything before it.
+        recorder.Commit();
         progress.Finish();
         return Fail(err, Stopped(where, error, recorder.Committed()));
     }

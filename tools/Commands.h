@@ -33,7 +33,10 @@ struct RecordCommand {
 // Records the operations in order. On a malformed line or a refused
 // operation, everything before that line is committed, nothing from it on,
 // and the message names the file, the line and how many operations of this
-// run are committed. Ends with a summary on `out`.
+// run are committed. An error of the store while recording commits nothing
+// more (the operation it interrupted may have half changed the tree in
+// memory); its message says how many operations the last commit kept. Ends
+// with a summary on `out`.
 int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err);
 
 // Every field's table in key order, one line each, or only `field`'s:
