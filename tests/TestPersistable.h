@@ -1,7 +1,7 @@
 #pragma once
 
-// Small persistable classes for the object model and runtime tests, with
-// their own reflection records, registered in the "tests" target.
+// A small persistable class for the object model and runtime tests, with its
+// own reflection record, registered in the "tests" target.
 //
 // TestNode image:
 //   schema    varint   1
@@ -9,8 +9,6 @@
 //   m_left    8 bytes  identity, 0 when empty
 //   m_right   8 bytes  identity
 // Both references are tree edges (VisitObjects and VisitPrefs report them).
-//
-// TestOther image: schema 1, then m_value (8 bytes).
 
 #include "tnObject/IObject.h"
 #include "tnObject/IObjectVisitor.h"
@@ -56,39 +54,17 @@ public:
     static inline int s_live = 0;  // instances alive
 };
 
-class TestOther : public PersistableMixin<IObjectBaseMixin<TestOther, EmptyBase>> {
-public:
-    void Serialise(Archive& ar) const {
-        SerialiseSchema(ar, 1);
-        ar << m_value;
-    }
-    void Deserialise(InputArchive& ar) {
-        schema_t schema;
-        DeserialiseSchema(ar, 1, schema);
-        ar >> m_value;
-    }
-
-    int64 m_value = 0;
-};
-
 inline const ReflectedClass& _GetReflected(const TestNode*) {
     static const ReflectedClass record = MakePersistableReflectedClass<TestNode>(
         "tarn::testing::TestNode", CopyableTypeOps<TestNode>());
     return record;
 }
 
-inline const ReflectedClass& _GetReflected(const TestOther*) {
-    static const ReflectedClass record = MakePersistableReflectedClass<TestOther>(
-        "tarn::testing::TestOther", CopyableTypeOps<TestOther>());
-    return record;
-}
-
-// Registers both classes once per process.
+// Registers the class once per process.
 inline void RegisterTestClasses() {
     static const bool registered = [] {
-        XTarget* target = GetXTarget("tests");
-        TARN_ASSERT(RegisterReflectedClass(&_GetReflected((TestNode*)0), target) == NSE_OK);
-        TARN_ASSERT(RegisterReflectedClass(&_GetReflected((TestOther*)0), target) == NSE_OK);
+        TARN_ASSERT(RegisterReflectedClass(&_GetReflected((TestNode*)0), GetXTarget("tests")) ==
+                    NSE_OK);
         return true;
     }();
     (void)registered;
