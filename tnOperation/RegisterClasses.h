@@ -5,8 +5,9 @@ namespace tarn {
 // Registers the reflection records of the offset-operations classes (the
 // record, the map header and both node kinds) with the runtime's class
 // registry, so that stored images of them can be loaded by class name.
-// Runs the four registration functions exactly once per process; later
-// calls do nothing. Every object space calls it when it is created.
+// Also enters the bounds-checked image check of each class, which the loader
+// runs before a class's reader sees an image from a store. Runs exactly once
+// per process; later calls do nothing. Every object space calls it when it is created.
 void RegisterOffsetOpsClasses();
 
 }  // namespace tarn

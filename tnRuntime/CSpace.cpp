@@ -133,7 +133,8 @@ ptr<IPersistable> CSpace::Resolve(OID oid, const ReflectedClass* expected) {
 // Loading an image:
 //   1. the store's image of `oid` (none -> error);
 //   2. the registered class of the image's class name (none, or not the
-//      expected class -> error);
+//      expected class -> error), and the class's image check, if it has one
+//      (a malformed image -> error, before any reader sees it);
 //   3. an empty instance from the class's creation function, asked for its
 //      IPersistable interface (none -> error);
 //   4. its Deserialise slot over the image (followed by kReadSlack zeros);
@@ -152,6 +153,13 @@ ptr<IPersistable> CSpace::Load(OID oid, const ReflectedClass* expected) {
     if (expected != nullptr && rc != expected) {
         throw RuntimeError(ObjectName(oid) + " has an image of class '" + image->className +
                            "' where '" + expected->m_name + "' was expected");
+    }
+    if (ImageCheckFn check = FindImageCheck(rc)) {
+        std::string problem = check(image->bytes.data(), image->bytes.size());
+        if (!problem.empty()) {
+            throw RuntimeError(ObjectName(oid) + " has a malformed image of class '" +
+                               image->className + "': " + problem);
+        }
     }
     ptr<IObject> created = rc->m_createFn != nullptr ? rc->m_createFn() : ptr<IObject>();
     if (created.m_self == nullptr) {

@@ -12,6 +12,7 @@ struct Registry {
     std::mutex mutex;
     std::map<std::string, std::unique_ptr<XTarget>, std::less<>> targets;
     std::map<std::string, const ReflectedClass*, std::less<>> classes;
+    std::map<const ReflectedClass*, ImageCheckFn> imageChecks;
 };
 
 Registry& TheRegistry() {
@@ -99,6 +100,19 @@ const ReflectedClass* FindReflectedClass(std::string_view name) {
     std::lock_guard<std::mutex> lock(r.mutex);
     auto it = r.classes.find(name);
     return it == r.classes.end() ? nullptr : it->second;
+}
+
+void RegisterImageCheck(const ReflectedClass* rc, ImageCheckFn check) {
+    Registry& r = TheRegistry();
+    std::lock_guard<std::mutex> lock(r.mutex);
+    r.imageChecks[rc] = check;
+}
+
+ImageCheckFn FindImageCheck(const ReflectedClass* rc) {
+    Registry& r = TheRegistry();
+    std::lock_guard<std::mutex> lock(r.mutex);
+    auto it = r.imageChecks.find(rc);
+    return it == r.imageChecks.end() ? nullptr : it->second;
 }
 
 }  // namespace tarn

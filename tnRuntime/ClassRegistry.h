@@ -40,6 +40,18 @@ XTarget* GetXTarget(std::string_view library);
 // The record registered under `name` in any target, or null.
 const ReflectedClass* FindReflectedClass(std::string_view name);
 
+// Checks an image of a class before the class's reader sees it. Readers of
+// persistable classes trust their input and test no bounds, so a class whose
+// images can come from outside (a store file) registers a check that walks
+// the image with bounds: it returns "" for a well-formed image of exactly
+// `size` bytes, otherwise what is wrong with it.
+using ImageCheckFn = std::string (*)(const octet_t* image, std::size_t size);
+
+// Enters (or replaces) the image check of `rc`.
+void RegisterImageCheck(const ReflectedClass* rc, ImageCheckFn check);
+// The image check of `rc`, or null when it has none.
+ImageCheckFn FindImageCheck(const ReflectedClass* rc);
+
 // Checks the form of a class name: identifiers (letters, digits, '_', not
 // starting with a digit) joined by "::".
 ENameSpaceError CheckClassName(std::string_view name);
