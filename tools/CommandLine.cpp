@@ -68,6 +68,9 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
         app.add_subcommand("show", "print one field's table, or every field's in key order");
     showCmd->add_option("--store", store, "store directory")->required();
     showCmd->add_option("--field", fieldText, "the field, OID/PATH (e.g. #12/0a0b)");
+    int64 limit = -1;
+    showCmd->add_option("--limit", limit, "print at most this many fields, then how many there are")
+        ->check(CLI::NonNegativeNumber);
     CLI::App* dumpCmd = app.add_subcommand("dump", "print the map's tree, level by level");
     CLI::App* validateCmd = app.add_subcommand(
         "validate", "check the tree and the store; exit status 0 only when all holds");
@@ -107,7 +110,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
                     return Usage(err, error);
                 }
             }
-            return RunShow(store, field, out, err);
+            return RunShow(store, field, limit, out, err);
         }
         if (*dumpCmd) {
             return RunDump(store, out, err);

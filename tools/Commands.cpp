@@ -295,8 +295,8 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
     return 0;
 }
 
-int RunShow(const std::string& store, const std::optional<FieldId>& field, std::ostream& out,
-            std::ostream& err) {
+int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
+            std::ostream& out, std::ostream& err) {
     OpenedSpace opened = OpenSpace(store, OpenMode::ReadOnly);
     CSpace& space = *opened.space;
     CSpaceGuard guard(space, LockMode::Shared);
@@ -314,8 +314,12 @@ int RunShow(const std::string& store, const std::optional<FieldId>& field, std::
         return 0;
     }
     RequireSoundTree(map);
-    for (auto it = map.begin(); it != map.end(); ++it) {
+    int64 shown = 0;
+    for (auto it = map.begin(); it != map.end() && shown != limit; ++it, ++shown) {
         os << it->first << " --> " << it->second << '\n';
+    }
+    if (shown < map.size()) {
+        os << "(" << shown << " of " << map.size() << " fields shown)\n";
     }
     return 0;
 }

@@ -41,9 +41,10 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err);
 
 // Every field's table in key order, one line each, or only `field`'s:
 //   #12/0a0b --> {(0123abcd-0000-4000-8000-00000000002a,(5,3)),...}
-// A field without a table is reported on `err` (status 1).
-int RunShow(const std::string& store, const std::optional<FieldId>& field, std::ostream& out,
-            std::ostream& err);
+// A field without a table is reported on `err` (status 1). A `limit` of 0 or
+// more prints at most that many fields and then how many there are.
+int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
+            std::ostream& out, std::ostream& err);
 
 // The map's dump (FieldIdToOffsetOpsOnInt64FieldMap::Write), after a check
 // that the tree can be walked safely.
