@@ -1,3 +1,6 @@
+// The record the LMDB store keeps per image: its layout, and that every
+// truncation and every changed byte is reported with the identity and fault.
+
 #include "tnRuntime/ImageRecord.h"
 
 #include <gtest/gtest.h>
@@ -9,9 +12,10 @@
 namespace tarn {
 namespace {
 
+using Bytes = std::vector<octet_t>;
+
 StoredImage SampleImage() {
-    StoredImage image;
-    image.className = "tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode";
+    StoredImage image{"tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode", {}};
     for (int i = 0; i < 300; ++i) {
         image.bytes.push_back(static_cast<octet_t>(i * 7));
     }
@@ -19,7 +23,7 @@ StoredImage SampleImage() {
 }
 
 // The message of the RuntimeError `record` raises when decoded as `oid`.
-std::string DecodeError(uint64 oid, const std::vector<octet_t>& record) {
+std::string DecodeError(uint64 oid, const Bytes& record) {
     try {
         DecodeImageRecord(oid, record);
     } catch (const RuntimeError& e) {
@@ -28,60 +32,43 @@ std::string DecodeError(uint64 oid, const std::vector<octet_t>& record) {
     return "(decoded without error)";
 }
 
-TEST(ImageRecordFormat, RoundTripsNamesAndBytesOfAnyLength) {
-    const StoredImage empty;
-    StoredImage sample = SampleImage();
-    for (const StoredImage& image : {empty, sample}) {
-        const std::vector<octet_t> record = EncodeImageRecord(42, image);
-        ASSERT_EQ(record.size(), 25 + image.className.size() + image.bytes.size());
-        const StoredImage back = DecodeImageRecord(42, record);
+TEST(ImageRecordFormat, HeaderThenNameThenBytesAndBackOfAnyLength) {
+    const Bytes record = EncodeImageRecord(1, StoredImage{"C", {0xAB}});
+    const Bytes head = {'T', 'N', 'I', 'M', 1, 1, 0, 0, 0, 'C', 1, 0, 0, 0, 0, 0, 0, 0, 0xAB};
+    EXPECT_EQ(Bytes(record.begin(), record.begin() + 19), head);
+    for (const StoredImage& image : {StoredImage{}, SampleImage()}) {
+        const Bytes encoded = EncodeImageRecord(42, image);
+        EXPECT_EQ(encoded.size(), 25 + image.className.size() + image.bytes.size());
+        const StoredImage back = DecodeImageRecord(42, encoded);
         EXPECT_EQ(back.className, image.className);
         EXPECT_EQ(back.bytes, image.bytes);
     }
 }
 
-TEST(ImageRecordFormat, HeaderFieldsSitWhereTheLayoutSays) {
-    StoredImage image;
-    image.className = "C";
-    image.bytes = {0xAB};
-    const std::vector<octet_t> record = EncodeImageRecord(1, image);
-    const std::vector<octet_t> head = {'T', 'N', 'I', 'M', 1, 1, 0, 0, 0,   'C',
-                                       1,   0,   0,   0,   0, 0, 0, 0, 0xAB};
-    EXPECT_EQ(std::vector<octet_t>(record.begin(), record.begin() + 19), head);
-}
-
-TEST(ImageRecordChecks, EveryTruncationIsReportedAsTruncated) {
-    const std::vector<octet_t> record = EncodeImageRecord(7, SampleImage());
+TEST(ImageRecordChecks, EveryTruncationAndChangedByteIsReported) {
+    const Bytes record = EncodeImageRecord(7, SampleImage());
     for (std::size_t size = 0; size < record.size(); ++size) {
-        const std::string error =
-            DecodeError(7, std::vector<octet_t>(record.begin(), record.begin() + size));
-        EXPECT_NE(error.find("image #7: truncated record"), std::string::npos)
-            << "size " << size << ": " << error;
+        const std::string error = DecodeError(7, Bytes(record.begin(), record.begin() + size));
+        EXPECT_NE(error.find("image #7: truncated record"), std::string::npos) << size << error;
     }
-}
-
-TEST(ImageRecordChecks, EveryFlippedByteIsRejected) {
-    const std::vector<octet_t> record = EncodeImageRecord(7, SampleImage());
     for (std::size_t at = 0; at < record.size(); ++at) {
-        std::vector<octet_t> bad = record;
+        Bytes bad = record;
         bad[at] ^= 0x10;
-        const std::string error = DecodeError(7, bad);
-        EXPECT_EQ(error.rfind("image #7: ", 0), 0u) << "byte " << at << ": " << error;
+        EXPECT_EQ(DecodeError(7, bad).rfind("image #7: ", 0), 0u) << at << DecodeError(7, bad);
     }
-}
-
-TEST(ImageRecordChecks, NamesTheFault) {
-    const std::vector<octet_t> record = EncodeImageRecord(7, SampleImage());
-    std::vector<octet_t> payload = record;
-    payload[100] ^= 1;
-    EXPECT_NE(DecodeError(7, payload).find("checksum mismatch"), std::string::npos);
-    std::vector<octet_t> version = record;
-    version[4] = 9;
-    EXPECT_NE(DecodeError(7, version).find("unknown record version 9"), std::string::npos);
-    std::vector<octet_t> magic = record;
-    magic[0] = 'X';
-    EXPECT_NE(DecodeError(7, magic).find("bad magic"), std::string::npos);
-    std::vector<octet_t> longer = record;
+    const struct {
+        std::size_t at;
+        octet_t value;
+        const char* error;
+    } faults[] = {{100, static_cast<octet_t>(record[100] ^ 1), "image #7: checksum mismatch"},
+                  {4, 9, "unknown record version 9"},
+                  {0, 'X', "bad magic"}};
+    for (const auto& f : faults) {
+        Bytes bad = record;
+        bad[f.at] = f.value;
+        EXPECT_NE(DecodeError(7, bad).find(f.error), std::string::npos) << DecodeError(7, bad);
+    }
+    Bytes longer = record;
     longer.push_back(0);
     EXPECT_NE(DecodeError(7, longer).find("1 unexpected bytes"), std::string::npos);
     // A record moved under another identity fails its checksum.

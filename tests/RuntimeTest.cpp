@@ -60,19 +60,15 @@ protected:
         m_guard = std::make_unique<CSpaceGuard>(*m_space, mode);
     }
 
-    // A complete binary tree of the given depth, values in preorder from
-    // `next`; identities follow the values when the store is fresh.
-    static TestNode* BuildTree(int depth, int64& next) {
-        TestNode* n = DollarNew(new TestNode(next++));
+    // A complete binary tree of the given depth, registered and valued in
+    // preorder from `first`; identities follow the values in a fresh store.
+    static TestNode* BuildTree(int depth, int64 first = 1) {
+        TestNode* n = DollarNew(new TestNode(first));
         if (depth > 1) {
-            n->m_left = BuildTree(depth - 1, next);
-            n->m_right = BuildTree(depth - 1, next);
+            n->m_left = BuildTree(depth - 1, first + 1);
+            n->m_right = BuildTree(depth - 1, first + (int64{1} << (depth - 1)));
         }
         return n;
-    }
-    static TestNode* BuildTree(int depth) {
-        int64 next = 1;
-        return BuildTree(depth, next);
     }
 
     // The sum of the values reached through references, and their number.
@@ -107,8 +103,10 @@ TEST_F(RuntimeTest, IdentitiesAreGivenAtRegistrationAndTheCounterPersists) {
     m_space->Commit();
     EXPECT_FALSE(a->IsDirty());
     EXPECT_EQ(m_store->Stats().numImages, 2);
-    DollarNew(new TestNode());  // never committed: its identity is not kept
+    BuildTree(3);  // never committed: dies with the space, identities not kept
     Open();
+    EXPECT_EQ(TestNode::s_live, m_live);
+    EXPECT_EQ(m_store->Stats().numImages, 2);
     EXPECT_EQ(DollarNew(new TestNode())->GetPersistObjState().m_oid, OID(Seid(3)));
     TestNode* created =
         static_cast<TestNode*>(m_space->CreateObject("tarn::testing::TestNode").m_self);
@@ -134,10 +132,14 @@ TEST_F(RuntimeTest, MarkingQueuesARegisteredObjectOnceAndIgnoresCopies) {
     EXPECT_EQ(m_space->NumDirty(), 1);
 }
 
+// Committed objects that refer to each other, all residents dropped, are
+// reached again through the references, from a root kept by name.
 TEST_F(RuntimeTest, DroppedResidentsLoadAgainThroughReferencesWithTheirState) {
     Open();
     TestNode* root = BuildTree(4);  // 15 nodes, values 1..15
-    m_space->SetRoot("tree", root->GetPersistObjState().m_oid);
+    m_space->SetRoot("tree", cref<TestNode>(root));
+    m_space->SetRoot("gone", OID(Seid(99)));
+    m_space->SetRoot("gone", OID());  // an empty root is removed
     m_space->Commit();
     EXPECT_EQ(m_space->DropCleanResidents(), 15);
     EXPECT_EQ(m_space->NumResidents(), 0);
@@ -150,11 +152,21 @@ TEST_F(RuntimeTest, DroppedResidentsLoadAgainThroughReferencesWithTheirState) {
     EXPECT_FALSE(again->IsDirty());
     Walk(again.Get());
     EXPECT_EQ(m_space->Stats().numLoaded, 15);
+    Open(LockMode::Shared);  // a shared holder loads without binding
+    EXPECT_EQ(m_space->Roots(), (std::map<std::string, OID>{{"tree", OID(Seid(1))}}));
+    cref<TestNode> shared(m_space->GetRoot("tree"));
+    EXPECT_EQ(shared->m_left->m_value, 2);
+    EXPECT_FALSE(shared.IsBound());
+    EXPECT_EQ(m_space->NumResidents(), 2);
 }
 
+// Eviction unbinds the references between residents and those held in
+// SpaceRefs; other local references must be unbound by hand.
 TEST_F(RuntimeTest, EvictionKeepsDirtyObjectsAndUnbindsReferencesToTheRest) {
     Open();
     TestNode* root = BuildTree(3);  // 1 (2 (3, 4), 5 (6, 7))
+    SpaceRef<TestNode> keep(*m_space, root);
+    SpaceRef<TestNode> copy(keep);
     m_space->Commit();
     TestNode* left = root->m_left.Get();
     left->m_value = 20;
@@ -162,13 +174,14 @@ TEST_F(RuntimeTest, EvictionKeepsDirtyObjectsAndUnbindsReferencesToTheRest) {
     EXPECT_EQ(m_space->DropCleanResidents(), 6);
     EXPECT_FALSE(left->m_left.IsBound());
     EXPECT_EQ(left->m_left->m_value, 3);  // loads again
-    cref<TestNode> r(OID(Seid(1)));
-    EXPECT_FALSE(r->m_left.IsBound());  // a fresh image
-    EXPECT_EQ(r->m_left.Get(), left);   // found among the residents
+    EXPECT_FALSE(keep.IsBound() || copy.IsBound());
+    EXPECT_FALSE(keep->m_left.IsBound());  // a fresh image
+    EXPECT_EQ(keep->m_left.Get(), left);   // found among the residents
+    cref<TestNode> local(keep);
     m_space->Commit();
     EXPECT_EQ(m_space->DropCleanResidents(), 3);
-    r.Unbind();  // a local reference is out of the evictor's reach
-    EXPECT_EQ(r->m_left->m_value, 20);
+    local.Unbind();
+    EXPECT_EQ(local->m_left->m_value, 20);
 }
 
 TEST_F(RuntimeTest, ResidentBoundEvictsTheOldestCleanObjectsAfterCommit) {
@@ -185,38 +198,11 @@ TEST_F(RuntimeTest, ResidentBoundEvictsTheOldestCleanObjectsAfterCommit) {
     EXPECT_EQ(m_space->NumResidents(), 4);
 }
 
-TEST_F(RuntimeTest, SpaceRefIsUnboundByEvictionAndSharedHoldersDoNotBind) {
-    Open();
-    SpaceRef<TestNode> keep(*m_space, DollarNew(new TestNode(8)));
-    m_space->Commit();
-    SpaceRef<TestNode> copy(keep);
-    m_space->DropCleanResidents();
-    EXPECT_FALSE(keep.IsBound());
-    EXPECT_FALSE(copy.IsBound());
-    EXPECT_EQ(copy->m_value, 8);
-    m_space->DropCleanResidents();
-    m_guard.reset();
-    m_guard = std::make_unique<CSpaceGuard>(*m_space, LockMode::Shared);
-    cref<TestNode> r(OID(Seid(1)));
-    EXPECT_EQ(r->m_value, 8);
-    EXPECT_FALSE(r.IsBound());
-    EXPECT_EQ(m_space->NumResidents(), 1);
-    EXPECT_TARN_ASSERT(r->MarkAsDirtyWithoutTrace(), "GetRecordedLockStatus(this) > 0");
-}
-
-TEST_F(RuntimeTest, DestroyingTheSpaceDiscardsUncommittedChanges) {
-    Open();
-    BuildTree(3);
-    m_guard.reset();
-    m_space.reset();
-    EXPECT_EQ(TestNode::s_live, m_live);
-    EXPECT_EQ(m_store->Stats().numImages, 0);
-}
-
-TEST_F(RuntimeTest, DeletionHappensOnlyAtCommit) {
+// Deletions queued during an operation are carried out only by a commit that
+// succeeds; a failed commit changes nothing and can be retried.
+TEST_F(RuntimeTest, DeletionHappensOnlyAtASuccessfulCommit) {
     Open();
     TestNode* root = BuildTree(2);
-    TestNode* fresh = DollarNew(new TestNode(9));
     m_space->Commit();
     TestNode* right = root->m_right.Get();
     AsyncPermanentlyDeleteObject(ptr<IPersistable>(right));
@@ -224,26 +210,32 @@ TEST_F(RuntimeTest, DeletionHappensOnlyAtCommit) {
     TestNode* brandNew = DollarNew(new TestNode(10));
     AsyncPermanentlyDeleteObject(ptr<IPersistable>(brandNew));
     AsyncPermanentlyDeleteObject(ptr<IPersistable>(brandNew));  // queued once
+    root->m_value = 10;
+    root->MarkAsDirtyWithoutTrace();
+    m_space->SetRoot("r", cref<TestNode>(root));
+    m_failing->m_failNext = true;
+    EXPECT_THROW(m_space->Commit(), RuntimeError);
     EXPECT_EQ(m_space->NumQueuedDeletions(), 3);
+    EXPECT_TRUE(root->IsDirty());
     EXPECT_EQ(right->m_value, 3);  // alive for the rest of the operation
-    EXPECT_EQ(TestNode::s_live, m_live + 5);
-    EXPECT_EQ(m_store->Stats().numImages, 4);
+    EXPECT_EQ(TestNode::s_live, m_live + 4);
+    EXPECT_EQ(m_store->Stats().numImages, 3);
+    EXPECT_FALSE(m_store->FindRoot("r").has_value());
 
     m_space->Commit();
-    EXPECT_EQ(TestNode::s_live, m_live + 2);
-    EXPECT_EQ(m_store->Stats().numImages, 2);  // the new object never reached the store
-    EXPECT_FALSE(m_space->IsResident(OID(Seid(3))));
+    EXPECT_FALSE(root->IsDirty());
+    EXPECT_EQ(TestNode::s_live, m_live + 1);
+    EXPECT_EQ(m_store->Stats().numImages, 1);  // the new object never reached the store
+    EXPECT_EQ(m_store->FindRoot("r"), std::optional<uint64>(1));
     EXPECT_FALSE(root->m_left.IsBound());  // references to deleted objects are unbound
     EXPECT_THROW(root->m_left.Get(), RuntimeError);
     EXPECT_EQ(root->m_right.TryGet(), nullptr);
-    EXPECT_EQ(fresh->m_value, 9);
 }
 
 TEST_F(RuntimeTest, SubTreeDeletionLoadsAndRemovesEverythingBelow) {
     Open();
     TestNode* holder = DollarNew(new TestNode(0));
-    int64 next = 1;
-    holder->m_left = BuildTree(3, next);  // identities 2..8
+    holder->m_left = BuildTree(3);  // identities 2..8
     m_space->Commit();
     m_space->DropCleanResidents();
     cref<TestNode> h(OID(Seid(1)));
@@ -257,61 +249,23 @@ TEST_F(RuntimeTest, SubTreeDeletionLoadsAndRemovesEverythingBelow) {
     EXPECT_EQ(m_space->Stats().numDeleted, 7);
 }
 
-TEST_F(RuntimeTest, FailedCommitChangesNothingAndCanBeRetried) {
-    Open();
-    TestNode* root = BuildTree(2);
-    m_space->Commit();
-    TestNode* right = root->m_right.Get();
-    AsyncPermanentlyDeleteObject(ptr<IPersistable>(right));
-    root->m_value = 10;
-    root->MarkAsDirtyWithoutTrace();
-    m_space->SetRoot("r", root->m_left);
-    m_failing->m_failNext = true;
-    EXPECT_THROW(m_space->Commit(), RuntimeError);
-    EXPECT_TRUE(root->IsDirty());
-    EXPECT_EQ(m_space->NumDirty(), 1);
-    EXPECT_EQ(m_space->NumQueuedDeletions(), 1);
-    EXPECT_EQ(right->m_value, 3);
-    EXPECT_EQ(m_store->Stats().numImages, 3);
-    EXPECT_FALSE(m_store->FindRoot("r").has_value());
-    m_space->Commit();
-    EXPECT_FALSE(root->IsDirty());
-    EXPECT_EQ(m_store->Stats().numImages, 2);
-    EXPECT_EQ(m_store->FindRoot("r"), std::optional<uint64>(2));
-}
-
-TEST_F(RuntimeTest, RootsArePersistedAtCommitAndAnEmptyOneIsRemoved) {
-    Open();
-    m_space->SetRoot("a", cref<TestNode>(DollarNew(new TestNode(1))));
-    m_space->SetRoot("b", OID(Seid(99)));
-    m_space->SetRoot("b", OID());
-    EXPECT_TRUE(m_space->GetRoot("b").IsNull());
-    m_space->Commit();
-    Open();
-    EXPECT_EQ(m_space->GetRoot("a"), OID(Seid(1)));
-    EXPECT_EQ(m_space->Roots().size(), 1u);
-}
-
-// TestNode image: schema 1, the value (8 bytes), two empty references.
-std::vector<octet_t> NodeImage(int64 value) {
+// TestNode image: schema 1, the value (8 bytes), two empty references; cut
+// or padded with zeros to `size` bytes.
+std::vector<octet_t> NodeImage(int64 value, std::size_t size = 25) {
     std::vector<octet_t> b = {1};
     for (int i = 0; i < 8; ++i) {
         b.push_back(static_cast<octet_t>(value >> (8 * i)));
     }
-    b.insert(b.end(), 16, 0);
+    b.resize(size);
     return b;
 }
 
 TEST_F(RuntimeTest, LoaderChecksClassAndLengthOfEveryImage) {
-    std::vector<octet_t> longer = NodeImage(1);
-    longer.push_back(0);
-    std::vector<octet_t> shorter = NodeImage(1);
-    shorter.pop_back();
     CommitBatch batch;
     batch.writes = {{1, {"tarn::testing::Unknown", NodeImage(1)}},
                     {2, {"tarn::OffsetOps", {1, 0, 0, 0, 0, 0, 0, 0, 0}}},
-                    {3, {"tarn::testing::TestNode", longer}},
-                    {4, {"tarn::testing::TestNode", shorter}},
+                    {3, {"tarn::testing::TestNode", NodeImage(1, 26)}},
+                    {4, {"tarn::testing::TestNode", NodeImage(1, 24)}},
                     {5, {"tarn::testing::TestNode", NodeImage(77)}}};
     batch.nextIdentity = 100;
     m_store->Commit(batch);
@@ -356,8 +310,13 @@ TEST_F(RuntimeTest, MisuseStopsTheProcess) {
             CSpaceGuard h(b, LockMode::Shared);
         },
         "t.space == nullptr || t.space == &space");
+    Open();
+    DollarNew(new TestNode());
+    m_space->Commit();
     Open(LockMode::Shared);
     EXPECT_TARN_ASSERT(DollarNew(new TestNode()), "GetRecordedLockStatus(this) > 0");
+    EXPECT_TARN_ASSERT(cref<TestNode>(OID(Seid(1)))->MarkAsDirtyWithoutTrace(),
+                       "GetRecordedLockStatus(this) > 0");
     EXPECT_TARN_ASSERT({ CSpaceGuard upgrade(*m_space, LockMode::Exclusive); },
                        "!(mode == LockMode::Exclusive && t.status < 0)");
     EXPECT_TARN_ASSERT(m_space.reset(), "GetThreadCSpace() != this");
