@@ -23,6 +23,7 @@
 #include "tnRuntime/ImageRecord.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/MemoryOutputStream.h"
+#include "tools/TreeCheck.h"
 
 namespace tarn::fuzz {
 
@@ -93,7 +94,7 @@ inline void Exercise(ptr<IPersistable> obj, int maxSteps) {
     } else if (rc == &GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMap>()) {
         map = static_cast<const FieldIdToOffsetOpsOnInt64FieldMap*>(obj.m_self);
     }
-    if (map == nullptr) {
+    if (map == nullptr || !tool::CheckTree(*map).Ok()) {
         return;
     }
     int steps = 0;

@@ -27,7 +27,9 @@ struct StoredImage {
     std::vector<octet_t> bytes;
 };
 
-// Everything one commit changes.
+// Everything one commit changes. A store applies the writes, then the
+// deletions (deleting an identity without an image is no error), then the
+// roots and the counter.
 struct CommitBatch {
     std::vector<std::pair<uint64, StoredImage>> writes;  // identity -> new image
     std::vector<uint64> deletes;                         // identities to remove

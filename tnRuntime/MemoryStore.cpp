@@ -48,12 +48,14 @@ void MemoryStore::Commit(const CommitBatch& batch) {
         roots[name] = oid;
     }
     // 2. Apply without allocating: relinking nodes and erasing cannot throw.
-    for (uint64 oid : batch.deletes) {
-        m_images.erase(oid);
-    }
+    //    Writes go first, then deletions, as in every store: an identity both
+    //    written and deleted in one batch ends up without an image.
     for (auto& node : nodes) {
         m_images.erase(node.key());
         m_images.insert(std::move(node));
+    }
+    for (uint64 oid : batch.deletes) {
+        m_images.erase(oid);
     }
     m_roots.swap(roots);
     m_nextIdentity = batch.nextIdentity;
