@@ -1,7 +1,8 @@
 #pragma once
 
 // The one invariant checker of the B+tree map, shared by every test that
-// changes a tree, plus key and payload makers for those tests.
+// changes a tree, plus key and payload makers and a fixture with a space and a
+// map for those tests.
 //
 // CheckBTree walks the whole tree (loading nodes as needed) and returns a
 // description of the first broken invariant, or "" when all hold:
@@ -21,6 +22,7 @@
 #include <memory>
 #include <sstream>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
@@ -38,11 +40,8 @@ namespace tarn::testing {
 // puts the path in a heap buffer without changing the order.
 inline FieldId MakeKey(uint64 i, bool longPath = false) {
     octet_t bytes[20];
-    for (int b = 0; b < 8; ++b) {
-        bytes[b] = static_cast<octet_t>(i >> (8 * (7 - b)));
-    }
-    for (int b = 8; b < 20; ++b) {
-        bytes[b] = static_cast<octet_t>(0xa0 + b);
+    for (int b = 0; b < 20; ++b) {
+        bytes[b] = static_cast<octet_t>(b < 8 ? i >> (8 * (7 - b)) : 0xa0 + b);
     }
     return FieldId(OID(Seid(uint64{7})), Path(bytes, longPath ? 20 : 8));
 }
@@ -50,6 +49,15 @@ inline FieldId MakeKey(uint64 i, bool longPath = false) {
 // A key with an arbitrary oid and path bytes.
 inline FieldId MakeKey(uint64 oid, const std::string& path) {
     return FieldId(OID(Seid(oid)), Path(path.data(), static_cast<ssize_t>(path.size())));
+}
+
+// The number i of a key made by MakeKey(i, ...).
+inline uint64 KeyNum(const FieldId& k) {
+    uint64 v = 0;
+    for (ssize_t i = 0; i < 8; ++i) {
+        v = (v << 8) | k.path.begin()[i];
+    }
+    return v;
 }
 
 inline Guid MakeSite(uint32 n) {
@@ -68,9 +76,8 @@ inline OffsetOpsOnField<int64> MakePayload(int64 offset, uint32 site = 1, ssize_
 inline std::string KeyText(const FieldId& k) {
     std::ostringstream os;
     os << "#" << k.oid.value_ << "/";
-    static const char* hex = "0123456789abcdef";
     for (octet_t b : k.path) {
-        os << hex[b >> 4] << hex[b & 15];
+        os << "0123456789abcdef"[b >> 4] << "0123456789abcdef"[b & 15];
     }
     return os.str();
 }
@@ -85,143 +92,96 @@ public:
 
     std::string Run() {
         const Map& m = m_map;
-        if (m.m_height < -1) {
-            return Fail("height below -1");
-        }
+        void* root = m.m_height >= 0 ? m.m_root.Get() : nullptr;
         if (m.m_height == -1) {
-            if (m.m_root) {
-                return Fail("height -1 with a root");
+            if (m.m_root || m.m_firstLeaf || m.m_lastLeaf || m.m_size != 0) {
+                Fail("height -1 with a root, a first or last leaf or a size");
             }
-            if (m.m_firstLeaf || m.m_lastLeaf) {
-                return Fail("height -1 with a first or last leaf");
-            }
-            if (m.m_size != 0) {
-                return Fail("height -1 with size " + std::to_string(m.m_size));
-            }
-            return "";
-        }
-        void* root = m.m_root.Get();
-        if (!root) {
-            return Fail("height >= 0 without a root");
-        }
-        if (m.m_height == 0 && (m.m_firstLeaf.Get() != root || m.m_lastLeaf.Get() != root)) {
-            return Fail("root leaf is not both first and last leaf");
-        }
-        if (!Node(m.m_height, root, true, nullptr, nullptr)) {
-            return m_error;
-        }
-        return CheckChain();
-    }
-
-private:
-    std::string Fail(const std::string& what) {
-        if (m_error.empty()) {
-            m_error = what;
+        } else if (!root) {
+            Fail("height " + std::to_string(m.m_height) + " without a root");
+        } else if (m.m_height == 0 && (m.m_firstLeaf.Get() != root || m.m_lastLeaf.Get() != root)) {
+            Fail("root leaf is not both first and last leaf");
+        } else if (Node(m.m_height, root, nullptr, nullptr)) {
+            Chain();
         }
         return m_error;
     }
 
-    bool Node(ssize_t height, void* node, bool isRoot, const FieldId* lo, const FieldId* hi) {
+private:
+    bool Fail(const std::string& what) {
+        m_error = m_error.empty() ? what : m_error;
+        return false;
+    }
+    static const FieldId& KeyOf(const Leaf* n, ssize_t i) { return n->GetEntry(i).first; }
+    static const FieldId& KeyOf(const Internal* n, ssize_t i) { return n->GetEntry(i).m_key; }
+
+    // Checks the subtree of `node`, whose keys must lie in [lo, hi).
+    bool Node(ssize_t height, void* node, const FieldId* lo, const FieldId* hi) {
         if (!node) {
-            Fail("null child at height " + std::to_string(height));
-            return false;
+            return Fail("null child at height " + std::to_string(height));
         }
         if (height == 0) {
-            return LeafNode(static_cast<Leaf*>(node), isRoot, lo, hi);
+            auto* leaf = static_cast<Leaf*>(node);
+            m_leaves.push_back(leaf);
+            m_total += leaf->m_numKeyEntrys;
+            return Keys(leaf, 0, lo, hi, "leaf #" + std::to_string(m_leaves.size() - 1));
         }
         auto* in = static_cast<Internal*>(node);
-        ssize_t nk = in->m_numKeyEntrys;
-        ssize_t min = isRoot ? 1 : 50;
-        if (nk < min || nk > 100) {
-            Fail("internal node at height " + std::to_string(height) + " holds " +
-                 std::to_string(nk) + " keys");
+        if (!Keys(in, 1, lo, hi, "internal node at height " + std::to_string(height)) ||
+            !Node(height - 1, in->m_ptr.Get(), lo, &KeyOf(in, 0))) {
             return false;
         }
-        if (!Ordered(
-                nk, [&](ssize_t i) -> const FieldId& { return in->GetEntry(i).m_key; }, lo, hi,
-                "internal", height)) {
-            return false;
-        }
-        if (!Node(height - 1, in->m_ptr.Get(), false, lo, &in->GetEntry(0).m_key)) {
-            return false;
-        }
-        for (ssize_t i = 0; i < nk; ++i) {
-            const FieldId* upper = i + 1 < nk ? &in->GetEntry(i + 1).m_key : hi;
-            if (!Node(height - 1, in->GetEntry(i).m_ptr.Get(), false, &in->GetEntry(i).m_key,
-                      upper)) {
+        for (ssize_t i = 0, nk = in->m_numKeyEntrys; i < nk; ++i) {
+            if (!Node(height - 1, in->GetEntry(i).m_ptr.Get(), &KeyOf(in, i),
+                      i + 1 < nk ? &KeyOf(in, i + 1) : hi)) {
                 return false;
             }
         }
         return true;
     }
 
-    bool LeafNode(Leaf* leaf, bool isRoot, const FieldId* lo, const FieldId* hi) {
-        ssize_t nk = leaf->m_numKeyEntrys;
-        ssize_t min = isRoot ? 0 : 50;
-        if (nk < min || nk > 100) {
-            Fail("leaf #" + std::to_string(m_leaves.size()) + " holds " + std::to_string(nk) +
-                 " entries");
-            return false;
+    // Invariants 3 to 5 for one node; `rootMin` is the least count of a root.
+    template <typename N>
+    bool Keys(const N* n, ssize_t rootMin, const FieldId* lo, const FieldId* hi,
+              const std::string& where) {
+        const ssize_t nk = n->m_numKeyEntrys;
+        if (nk < (lo || hi ? 50 : rootMin) || nk > 100) {
+            return Fail(where + " holds " + std::to_string(nk) + " entries");
         }
-        m_leaves.push_back(leaf);
-        m_total += nk;
-        return Ordered(
-            nk, [&](ssize_t i) -> const FieldId& { return leaf->GetEntry(i).first; }, lo, hi,
-            "leaf", 0);
-    }
-
-    template <typename KeyAt>
-    bool Ordered(ssize_t nk, KeyAt key, const FieldId* lo, const FieldId* hi, const char* kind,
-                 ssize_t height) {
-        std::string where = std::string(kind) + " at height " + std::to_string(height);
         for (ssize_t i = 1; i < nk; ++i) {
-            if (CompareKeys(key(i - 1), key(i)) >= 0) {
-                Fail(where + ": keys " + std::to_string(i - 1) + " and " + std::to_string(i) +
-                     " out of order");
-                return false;
+            if (CompareKeys(KeyOf(n, i - 1), KeyOf(n, i)) >= 0) {
+                return Fail(where + ": keys " + std::to_string(i - 1) + " and " +
+                            std::to_string(i) + " out of order");
             }
         }
-        if (nk > 0 && lo && CompareKeys(*lo, key(0)) > 0) {
-            Fail(where + ": first key " + KeyText(key(0)) + " below separator " + KeyText(*lo));
-            return false;
+        if (nk > 0 && lo && CompareKeys(*lo, KeyOf(n, 0)) > 0) {
+            return Fail(where + ": first key " + KeyText(KeyOf(n, 0)) + " below separator " +
+                        KeyText(*lo));
         }
-        if (nk > 0 && hi && CompareKeys(key(nk - 1), *hi) >= 0) {
-            Fail(where + ": last key " + KeyText(key(nk - 1)) + " not below separator " +
-                 KeyText(*hi));
-            return false;
+        if (nk > 0 && hi && CompareKeys(KeyOf(n, nk - 1), *hi) >= 0) {
+            return Fail(where + ": last key " + KeyText(KeyOf(n, nk - 1)) +
+                        " not below separator " + KeyText(*hi));
         }
         return true;
     }
 
-    std::string CheckChain() {
+    void Chain() {
         const Map& m = m_map;
-        if (m.m_firstLeaf.Get() != m_leaves.front()) {
-            return Fail("m_firstLeaf is not the leftmost leaf");
-        }
-        if (m.m_lastLeaf.Get() != m_leaves.back()) {
-            return Fail("m_lastLeaf is not the rightmost leaf");
-        }
-        if (m_leaves.front()->m_prev) {
-            return Fail("first leaf has a predecessor");
-        }
-        if (m_leaves.back()->m_next) {
-            return Fail("last leaf has a successor");
+        if (m.m_firstLeaf.Get() != m_leaves.front() || m.m_lastLeaf.Get() != m_leaves.back()) {
+            Fail("m_firstLeaf or m_lastLeaf is not the outermost leaf");
+        } else if (m_leaves.front()->m_prev || m_leaves.back()->m_next) {
+            Fail("the leaf chain goes on past the outermost leaves");
+        } else if (m.m_size != m_total) {
+            Fail("m_size " + std::to_string(m.m_size) + " but leaves hold " +
+                 std::to_string(m_total));
         }
         for (std::size_t i = 0; i + 1 < m_leaves.size(); ++i) {
-            if (m_leaves[i]->m_next.Get() != m_leaves[i + 1]) {
-                return Fail("m_next of leaf #" + std::to_string(i) + " is not leaf #" +
-                            std::to_string(i + 1));
-            }
-            if (m_leaves[i + 1]->m_prev.Get() != m_leaves[i]) {
-                return Fail("m_prev of leaf #" + std::to_string(i + 1) + " is not leaf #" +
-                            std::to_string(i));
+            if (m_leaves[i]->m_next.Get() != m_leaves[i + 1] ||
+                m_leaves[i + 1]->m_prev.Get() != m_leaves[i]) {
+                Fail("leaves #" + std::to_string(i) + " and #" + std::to_string(i + 1) +
+                     " are not linked both ways");
             }
         }
-        if (m.m_size != m_total) {
-            return Fail("m_size " + std::to_string(m.m_size) + " but leaves hold " +
-                        std::to_string(m_total));
-        }
-        return "";
     }
 
     const Map& m_map;
@@ -242,6 +202,22 @@ inline std::vector<ssize_t> LeafCounts(const FieldIdToOffsetOpsOnInt64FieldMap& 
         counts.push_back(leaf->m_numKeyEntrys);
     }
     return counts;
+}
+
+// Vector helpers for writing expected shapes.
+template <typename T>
+std::vector<T> operator+(std::vector<T> a, const std::vector<T>& b) {
+    a.insert(a.end(), b.begin(), b.end());
+    return a;
+}
+template <typename T>
+std::vector<T> Slice(const std::vector<T>& a, std::size_t from, std::size_t to) {
+    return std::vector<T>(a.begin() + std::ptrdiff_t(from), a.begin() + std::ptrdiff_t(to));
+}
+template <typename T>
+std::vector<T> WithoutAt(std::vector<T> a, std::size_t i) {
+    a.erase(a.begin() + std::ptrdiff_t(i));
+    return a;
 }
 
 // ---- Runtime helpers ---------------------------------------------------------
@@ -294,12 +270,13 @@ uint64 Oid(const T* obj) {
 }
 
 // A space over a recording store, held exclusively by the test's thread, with
-// one registered map in it.
+// one registered map in it, and the shape helpers of the exact-shape tests.
 class BTreeSpaceTest : public ::testing::Test {
 protected:
     using Map = FieldIdToOffsetOpsOnInt64FieldMap;
     using Leaf = FieldIdToOffsetOpsOnInt64FieldMapLeafNode;
     using Internal = FieldIdToOffsetOpsOnInt64FieldMapInternalNode;
+    using Keys = std::vector<uint64>;
 
     BTreeSpaceTest()
         : m_store(std::make_shared<RecordingStore>()),
@@ -327,10 +304,88 @@ protected:
 
     RuntimeCallLog& Log() { return GetThreadRuntimeCallLog(); }
 
+    // Shape keys: K(i) is key number i * kGap, so that further keys fit
+    // between any two; long when m_longKeys is set.
+    static constexpr uint64 kGap = 1000;
+    FieldId K(uint64 i) const { return Key(i * kGap); }
+    FieldId Key(uint64 num) const { return MakeKey(num, m_longKeys); }
+
+    // Inserts the key numbered `num` with payload `num`.
+    void Put(uint64 num) { ASSERT_TRUE(map().Insert(Key(num), MakePayload(int64(num)), false)); }
+    // K(first) .. K(last) in ascending order: every leaf but the last ends
+    // with 50 entries and, once the root has split, every internal node with 50.
+    void Fill(uint64 first, uint64 last) {
+        for (uint64 i = first; i <= last; ++i) {
+            Put(i * kGap);
+        }
+    }
+    // Every entry still carries the payload written with its key by Put.
+    void ExpectPayloadsFollowKeys() {
+        for (auto it = static_cast<const Map&>(map()).begin(); it != map().end(); ++it) {
+            EXPECT_EQ(it->second, MakePayload(int64(KeyNum(it->first))));
+        }
+    }
+
+    static Internal* AsInternal(void* n) {
+        return FieldIdToOffsetOpsOnInt64FieldMapAsInternalNode(n);
+    }
+    static Leaf* AsLeaf(void* n) { return FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(n); }
+    Internal* Root() { return AsInternal(map().m_root.Get()); }
+    // Leaf i of the chain, counting from 0.
+    Leaf* LeafAt(std::size_t i) {
+        Leaf* leaf = map().m_firstLeaf.Get();
+        while (i-- > 0) {
+            leaf = leaf->m_next.Get();
+        }
+        return leaf;
+    }
+    static Keys LeafKeys(const Leaf* leaf) {
+        Keys out;
+        for (ssize_t i = 0; i < leaf->m_numKeyEntrys; ++i) {
+            out.push_back(KeyNum(leaf->GetEntry(i).first));
+        }
+        return out;
+    }
+    static Keys Separators(const Internal* node) {
+        Keys out;
+        for (ssize_t i = 0; i < node->m_numKeyEntrys; ++i) {
+            out.push_back(KeyNum(node->GetEntry(i).m_key));
+        }
+        return out;
+    }
+    // The children of an internal node, leftmost (m_ptr) first.
+    static std::vector<void*> Children(const Internal* node) {
+        std::vector<void*> out{node->m_ptr.Get()};
+        for (ssize_t i = 0; i < node->m_numKeyEntrys; ++i) {
+            out.push_back(node->GetEntry(i).m_ptr.Get());
+        }
+        return out;
+    }
+    // An internal node as (separator number, child) pairs; the leftmost
+    // child comes first, with separator 0.
+    using Entries = std::vector<std::pair<uint64, void*>>;
+    static Entries EntriesOf(const Internal* node) {
+        Entries out{{0, node->m_ptr.Get()}};
+        for (ssize_t i = 0; i < node->m_numKeyEntrys; ++i) {
+            out.emplace_back(KeyNum(node->GetEntry(i).m_key), node->GetEntry(i).m_ptr.Get());
+        }
+        return out;
+    }
+    static Entries One(uint64 key, void* child) { return {{key, child}}; }
+    // Every key number of the map, in iteration order.
+    Keys AllKeys() {
+        Keys out;
+        for (auto it = static_cast<const Map&>(map()).begin(); it != map().end(); ++it) {
+            out.push_back(KeyNum(it->first));
+        }
+        return out;
+    }
+
     std::shared_ptr<RecordingStore> m_store;
     CSpace m_space;
     CSpaceGuard m_guard;
     Map* m_map = nullptr;
+    bool m_longKeys = false;
 };
 
 }  // namespace tarn::testing

@@ -1,9 +1,11 @@
 // The offset operations record end to end: recording under the lock check,
-// clearing, its image, printing, the map dump and validation, reflection and
-// registration, and a round trip through commit and reload.
+// clearing, its image, printing, a round trip through commit and reload, the
+// reflection records and registration of the module's four classes, and the
+// map's dump and validation.
 
 #include <gtest/gtest.h>
 
+#include <cstdio>
 #include <map>
 #include <string>
 #include <vector>
@@ -24,7 +26,9 @@ namespace {
 
 using testing::MakeKey;
 using testing::MakeSite;
+using testing::operator+;
 using Bytes = std::vector<octet_t>;
+using Map = FieldIdToOffsetOpsOnInt64FieldMap;
 
 template <typename T>
 Bytes ImageOf(const T& obj) {
@@ -35,21 +39,13 @@ Bytes ImageOf(const T& obj) {
     return out.bytes();
 }
 
-template <typename T>
-std::string TextOf(const T& x) {
+// What `write` prints on a fresh stream.
+template <typename F>
+std::string TextOf(F write) {
     StringOutputStream out;
     {
         xostream os(out);
-        os << x;
-    }
-    return out.str();
-}
-
-std::string DumpOf(const FieldIdToOffsetOpsOnInt64FieldMap& m) {
-    StringOutputStream out;
-    {
-        xostream os(out);
-        m.Write(os);
+        write(os);
     }
     return out.str();
 }
@@ -62,14 +58,6 @@ Bytes Le64(uint64 v) {
     return b;
 }
 
-Bytes Cat(std::initializer_list<Bytes> parts) {
-    Bytes all;
-    for (const Bytes& p : parts) {
-        all.insert(all.end(), p.begin(), p.end());
-    }
-    return all;
-}
-
 Opid Op(uint32 site, int64 t) {
     return Opid(MakeSite(site), t);
 }
@@ -79,18 +67,24 @@ protected:
     CSpace space;
 };
 
-TEST_F(OffsetOpsTest, NewRecordRefersToAnEmptyMapAndPrintsItsReference) {
+TEST_F(OffsetOpsTest, NewRecordRefersToAnEmptyMapAndPrintsOnlyItsReference) {
     CSpaceGuard g(space, LockMode::Exclusive);
     OffsetOps* rec = CreatePersistent<OffsetOps>();
-    ASSERT_TRUE(static_cast<bool>(rec->m_map));
-    FieldIdToOffsetOpsOnInt64FieldMap* map = rec->m_map.Get();
-    uint64 mapId = map->GetPersistObjState().m_oid.value_;
-    EXPECT_EQ(ImageOf(*rec), Cat({{0x01}, Le64(mapId)}));
-    EXPECT_EQ(ImageOf(*map), Cat({{0x01, 0x00}, Le64(0), Le64(0), Le64(0), {0x00}}));
-    EXPECT_EQ(TextOf(*rec), "#" + std::to_string(mapId));
-
+    Map* map = rec->m_map.Get();
+    ASSERT_NE(map, nullptr);
+    const uint64 mapId = map->GetPersistObjState().m_oid.value_;
+    EXPECT_EQ(ImageOf(*rec), Bytes{0x01} + Le64(mapId));
+    EXPECT_EQ(ImageOf(*map), (Bytes{0x01, 0x00} + Le64(0) + Le64(0) + Le64(0) + Bytes{0x00}));
     rec->RecordOffset(Op(1, 5), MakeKey(1), 12);
-    EXPECT_EQ(TextOf(*rec), "#" + std::to_string(mapId));  // never the tables
+    EXPECT_EQ(TextOf([&](xostream& os) { os << *rec; }), "#" + std::to_string(mapId));
+
+    // Another record read from this image refers to the same map object.
+    const Bytes image = ImageOf(*rec);
+    OffsetOps copy;
+    InputArchive in(image.data());
+    copy.Deserialise(in);
+    EXPECT_EQ(in.ptr(), image.data() + image.size());
+    EXPECT_EQ(copy.m_map.Get(), map);
     space.Commit();
 }
 
@@ -101,13 +95,12 @@ TEST_F(OffsetOpsTest, RecordsSumPerSiteAndFieldAndClearStartsAfresh) {
     rec->RecordOffset(Op(1, 5), MakeKey(1), 4);   // equal time stamps add up
     rec->RecordOffset(Op(2, 3), MakeKey(1), -7);  // a second site, same field
     rec->RecordOffset(Op(1, 9), MakeKey(2), 0);   // a second field; 0 still records
-    FieldIdToOffsetOpsOnInt64FieldMap& map = *rec->m_map;
+    Map& map = *rec->m_map;
     ASSERT_EQ(map.size(), 2);
-    const OffsetOpsOnField<int64>* first = map.rFind(MakeKey(1));
-    ASSERT_NE(first, nullptr);
-    EXPECT_EQ(first->m_map.size(), 2u);
-    EXPECT_EQ(first->m_map.getmap().at(MakeSite(1)), SiteOffset<int64>(5, 6));
-    EXPECT_EQ(first->m_map.getmap().at(MakeSite(2)), SiteOffset<int64>(3, -7));
+    const auto& first = map.rFind(MakeKey(1))->m_map.getmap();
+    EXPECT_EQ(first.size(), 2u);
+    EXPECT_EQ(first.at(MakeSite(1)), SiteOffset<int64>(5, 6));
+    EXPECT_EQ(first.at(MakeSite(2)), SiteOffset<int64>(3, -7));
     EXPECT_EQ(map.rFind(MakeKey(2))->m_map.getmap().at(MakeSite(1)), SiteOffset<int64>(9, 0));
 
     rec->Clear();
@@ -116,73 +109,6 @@ TEST_F(OffsetOpsTest, RecordsSumPerSiteAndFieldAndClearStartsAfresh) {
     rec->RecordOffset(Op(1, 1), MakeKey(1), 3);  // an earlier time stamp is fine again
     EXPECT_EQ(map.rFind(MakeKey(1))->m_map.getmap().at(MakeSite(1)), SiteOffset<int64>(1, 3));
     space.Commit();
-}
-
-TEST_F(OffsetOpsTest, ReadingAnotherRecordsImageRefersToTheSameMap) {
-    CSpaceGuard g(space, LockMode::Exclusive);
-    OffsetOps* rec = CreatePersistent<OffsetOps>();
-    Bytes image = ImageOf(*rec);
-    OffsetOps copy;
-    InputArchive in(image.data());
-    copy.Deserialise(in);
-    EXPECT_EQ(in.ptr(), image.data() + image.size());
-    EXPECT_EQ(copy.m_map.Get(), rec->m_map.Get());
-    space.Commit();
-}
-
-// Enough ascending keys for more than 100 leaves, so the root sits two
-// levels above them.
-constexpr int kKeysForHeight2 = 5200;
-
-TEST_F(OffsetOpsTest, TablesSurviveCommitAndReloadFromTheStore) {
-    std::map<FieldId, std::map<uint32, SiteOffset<int64>>> model;
-    {
-        CSpaceGuard g(space, LockMode::Exclusive);
-        OffsetOps* rec = CreatePersistent<OffsetOps>();
-        space.SetRoot("offsets", rec->GetPersistObjState().m_oid);
-        for (int i = 0; i < kKeysForHeight2; ++i) {
-            for (uint32 site = 1; site <= uint32(1 + i % 3); ++site) {
-                FieldId key = MakeKey(uint64(i), i % 5 == 0);
-                rec->RecordOffset(Op(site, i), key, i - 100 * int64(site));
-                SiteOffset<int64>& so = model[key][site];
-                so.t = i;
-                so.o += i - 100 * int64(site);
-            }
-        }
-        EXPECT_EQ(rec->m_map->m_height, 2);
-        space.Commit();
-        EXPECT_EQ(space.DropCleanResidents(), space.Stats().numRegistered);
-        EXPECT_EQ(space.NumResidents(), 0);
-    }
-    CSpaceGuard g(space, LockMode::Shared);
-    SpaceRef<OffsetOps> rec(space, space.GetRoot("offsets"));
-    const FieldIdToOffsetOpsOnInt64FieldMap& map = *rec->m_map;
-    EXPECT_EQ(testing::CheckBTree(map), "");
-    map.Validate();
-    ASSERT_EQ(map.size(), ssize_t(model.size()));
-    auto expected = model.begin();
-    for (auto it = map.begin(); it != map.end(); ++it, ++expected) {
-        const auto& [key, table] = *it;
-        EXPECT_EQ(key, expected->first);
-        ASSERT_EQ(table.m_map.size(), expected->second.size());
-        for (const auto& [site, so] : expected->second) {
-            EXPECT_EQ(table.m_map.getmap().at(MakeSite(site)), so);
-        }
-    }
-}
-
-TEST_F(OffsetOpsTest, ClearThenCommitLeavesNoNodeImageBehind) {
-    CSpaceGuard g(space, LockMode::Exclusive);
-    OffsetOps* rec = CreatePersistent<OffsetOps>();
-    for (int i = 0; i < 1000; ++i) {
-        rec->RecordOffset(Op(1, i), MakeKey(uint64(i)), 1);
-    }
-    space.Commit();
-    EXPECT_GT(space.GetStore().Stats().numImages, 10);
-    rec->Clear();
-    space.Commit();
-    EXPECT_EQ(space.GetStore().Stats().numImages, 2);  // the record and the map header
-    EXPECT_EQ(space.NumResidents(), 2);
 }
 
 TEST_F(OffsetOpsTest, ChangesNeedTheExclusiveLockAndACreatedRecordIsLocal) {
@@ -207,153 +133,200 @@ TEST_F(OffsetOpsTest, ChangesNeedTheExclusiveLockAndACreatedRecordIsLocal) {
     space.Commit();
 }
 
-TEST(OffsetOpsReflection, RecordsHoldTheirClassesAndRegisterOnce) {
-    const ReflectedClass& rc = _GetReflected(static_cast<OffsetOps*>(nullptr));
-    EXPECT_EQ(&rc, &GetReflectedClass<OffsetOps>());
-    EXPECT_EQ(rc.m_flags, 1u);
-    EXPECT_STREQ(rc.m_name, "tarn::OffsetOps");
-    EXPECT_EQ(rc.m_size, ssize_t(sizeof(OffsetOps)));
-    EXPECT_EQ(rc.m_ops.m_size, rc.m_size);
-    EXPECT_EQ(rc.m_numIndirectInterfaces, 1);
-    EXPECT_EQ(rc.m_numDirectInterfaces, 1);
-    EXPECT_STREQ(rc.m_interfaces[0], "tarn::IObject");
-    EXPECT_STREQ(rc.m_interfaces[1], "tarn::IPersistable");
-    EXPECT_EQ(rc.m_IObjectFnTable, &IObject::Stubs<OffsetOps>::GetTable());
-    EXPECT_NE(rc.m_ops.m_PrintVariableFn, nullptr);
-    EXPECT_NE(rc.m_ops.m_ConstructArrayFn, nullptr);
-    EXPECT_NE(rc.m_ops.m_DestructArrayFn, nullptr);
-    EXPECT_EQ(rc.m_ops.m_CopyConstructArrayFn, nullptr);
-    EXPECT_EQ(rc.m_ops.m_AssignArrayFn, nullptr);
-    EXPECT_EQ(rc.m_ops.m_equalsFn, nullptr);
-    EXPECT_EQ(_GetTypeOps(static_cast<OffsetOps*>(nullptr)), &rc.m_ops);
-
-    OffsetOps rec;
-    ptr<IObject> handle(&rec);
-    EXPECT_EQ(handle->GetReflectedClass(), &rc);
-
-    RegisterOffsetOpsClasses();
-    RegisterOffsetOpsClasses();  // idempotent
-    EXPECT_DEATH(
-        _Register_OffsetOps(),
-        testing::RegexQuote("void tarn::_Register_OffsetOps(): Assertion "
-                            "\"tarn::RegisterReflectedClass(&_GetReflected( (OffsetOps*) "
-                            "0),tarn::Tarn_tnOperation_GetXTarget()) == tarn::NSE_OK\" failed."));
+// Enough keys for more than 100 leaves, so that the root sits two levels
+// above them; every fifth key is long, and up to three sites record per key.
+TEST_F(OffsetOpsTest, TablesSurviveCommitAndReloadFromTheStore) {
+    std::map<FieldId, std::map<uint32, SiteOffset<int64>>> model;
+    {
+        CSpaceGuard g(space, LockMode::Exclusive);
+        OffsetOps* rec = CreatePersistent<OffsetOps>();
+        space.SetRoot("offsets", rec->GetPersistObjState().m_oid);
+        for (int i = 0; i < 5200; ++i) {
+            for (uint32 site = 1; site <= uint32(1 + i % 3); ++site) {
+                const FieldId key = MakeKey(uint64(i), i % 5 == 0);
+                rec->RecordOffset(Op(site, i), key, i - 100 * int64(site));
+                model[key][site] = SiteOffset<int64>(i, i - 100 * int64(site));
+            }
+        }
+        EXPECT_EQ(rec->m_map->m_height, 2);
+        space.Commit();
+        EXPECT_EQ(space.DropCleanResidents(), space.Stats().numRegistered);
+        EXPECT_EQ(space.NumResidents(), 0);
+    }
+    CSpaceGuard g(space, LockMode::Shared);
+    SpaceRef<OffsetOps> rec(space, space.GetRoot("offsets"));
+    const Map& map = *rec->m_map;
+    EXPECT_BTREE_OK(map);
+    map.Validate();
+    ASSERT_EQ(map.size(), ssize_t(model.size()));
+    auto expected = model.begin();
+    for (auto it = map.begin(); it != map.end(); ++it, ++expected) {
+        EXPECT_EQ(it->first, expected->first);
+        ASSERT_EQ(it->second.m_map.size(), expected->second.size());
+        for (const auto& [site, so] : expected->second) {
+            EXPECT_EQ(it->second.m_map.getmap().at(MakeSite(site)), so);
+        }
+    }
 }
 
-TEST(OffsetOpsReflection, PrintThroughTypeOperations) {
-    OffsetOps rec;
-    StringOutputStream out;
-    {
-        xostream os(out);
-        GetReflectedClass<OffsetOps>().m_ops.m_PrintVariableFn(os, &rec);
+TEST_F(OffsetOpsTest, ClearThenCommitLeavesNoNodeImageBehind) {
+    CSpaceGuard g(space, LockMode::Exclusive);
+    OffsetOps* rec = CreatePersistent<OffsetOps>();
+    for (int i = 0; i < 1000; ++i) {
+        rec->RecordOffset(Op(1, i), MakeKey(uint64(i)), 1);
     }
-    EXPECT_EQ(out.str(), "#0");
+    space.Commit();
+    EXPECT_GT(space.GetStore().Stats().numImages, 10);
+    rec->Clear();
+    space.Commit();
+    EXPECT_EQ(space.GetStore().Stats().numImages, 2);  // the record and the map header
+    EXPECT_EQ(space.NumResidents(), 2);
+}
+
+// ---- Reflection records and registration of the four classes ----
+
+template <typename T>
+void ExpectRecord(const char* name, void (*registration)(), bool isRecord = false) {
+    SCOPED_TRACE(name);
+    const ReflectedClass& rc = _GetReflected(static_cast<const T*>(nullptr));
+    EXPECT_EQ(&rc, &GetReflectedClass<T>());
+    EXPECT_EQ(FindReflectedClass(name), &rc);
+    EXPECT_STREQ(rc.m_name, name);
+    EXPECT_EQ(rc.m_flags, 1u);
+    EXPECT_EQ(rc.m_size, ssize_t(sizeof(T)));
+    EXPECT_EQ(rc.m_ops.m_size, rc.m_size);
+    ASSERT_EQ(rc.m_numIndirectInterfaces, 1);
+    ASSERT_EQ(rc.m_numDirectInterfaces, 1);
+    EXPECT_STREQ(rc.m_interfaces[0], "tarn::IObject");
+    EXPECT_STREQ(rc.m_interfaces[1], "tarn::IPersistable");
+    EXPECT_EQ(rc.m_IObjectFnTable, &IObject::Stubs<T>::GetTable());
+    EXPECT_EQ(rc.m_createFn, &T::sfnCreateInstance);
+    EXPECT_EQ(_GetTypeOps(static_cast<const T*>(nullptr)), &rc.m_ops);
+    EXPECT_TRUE(rc.m_ops.m_ConstructArrayFn && rc.m_ops.m_DestructArrayFn);
+    // The record prints but is not copied; the tree's classes copy but do not print.
+    EXPECT_EQ(rc.m_ops.m_PrintVariableFn != nullptr, isRecord);
+    EXPECT_EQ(rc.m_ops.m_CopyConstructArrayFn != nullptr, !isRecord);
+    EXPECT_EQ(rc.m_ops.m_AssignArrayFn != nullptr, !isRecord);
+    EXPECT_TRUE(!rc.m_ops.m_equalsFn && !rc.m_ops.m_SerialiseArrayFn && !rc.m_metaData);
+
+    T obj;
+    ptr<IObject> handle(&obj);
+    EXPECT_EQ(handle->GetReflectedClass(), &rc);
+    AnyInterface p = obj.QueryInterface(GetReflectedInterface<IPersistable>());
+    EXPECT_EQ(p.m_self, &obj);
+    EXPECT_EQ(p.m_table,
+              reinterpret_cast<const FunctionPointer*>(&IPersistable::Stubs<T>::GetTable()));
+    ReflectedInterface lookalike{"tarn::IObject"};  // told apart by address, not name
+    EXPECT_EQ(obj.QueryInterface(lookalike).m_self, nullptr);
+
+    const std::string cls = std::string(name).substr(6);
+    EXPECT_DEATH(registration(),
+                 testing::RegexQuote("void tarn::_Register_" + cls +
+                                     "(): Assertion \"tarn::RegisterReflectedClass(&_GetReflected( "
+                                     "(" +
+                                     cls +
+                                     "*) 0),tarn::Tarn_tnOperation_GetXTarget()) == "
+                                     "tarn::NSE_OK\" failed."));
+}
+
+TEST(ModuleReflection, RecordsOfTheFourClassesRegisterOnce) {
+    RegisterOffsetOpsClasses();
+    RegisterOffsetOpsClasses();  // idempotent
+    ExpectRecord<OffsetOps>("tarn::OffsetOps", _Register_OffsetOps, true);
+    ExpectRecord<Map>("tarn::FieldIdToOffsetOpsOnInt64FieldMap",
+                      _Register_FieldIdToOffsetOpsOnInt64FieldMap);
+    ExpectRecord<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>(
+        "tarn::FieldIdToOffsetOpsOnInt64FieldMapInternalNode",
+        _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode);
+    ExpectRecord<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>(
+        "tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode",
+        _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode);
+
+    OffsetOps rec;
+    EXPECT_EQ(TextOf([&](xostream& os) {
+                  GetReflectedClass<OffsetOps>().m_ops.m_PrintVariableFn(os, &rec);
+              }),
+              "#0");
 }
 
 // ---- The dump, validation and node counts of the map ----
 
-class MapDiagnosticsTest : public ::testing::Test {
+class MapDiagnosticsTest : public testing::BTreeSpaceTest {
 protected:
-    MapDiagnosticsTest() : guard(space, LockMode::Exclusive) {
-        map = DollarNew(new FieldIdToOffsetOpsOnInt64FieldMap());
+    std::string Dump() {
+        return TextOf([&](xostream& os) { map().Write(os); });
     }
-    ~MapDiagnosticsTest() override { space.Commit(); }
-
-    CSpace space;
-    CSpaceGuard guard;
-    FieldIdToOffsetOpsOnInt64FieldMap* map;
 };
 
 TEST_F(MapDiagnosticsTest, EmptyMapsPrintTheirHeightAndCountTheirNodes) {
-    EXPECT_EQ(DumpOf(*map), "Height = -1\n");
-    EXPECT_EQ(map->GetNumNodes(), 0);
-    map->Validate();
+    EXPECT_EQ(Dump(), "Height = -1\n");
+    EXPECT_EQ(map().GetNumNodes(), 0);
+    map().Validate();
 
-    FieldIdToOffsetOpsOnInt64FieldMap::wFindRet ret;
-    map->wFind(ret, MakeKey(1), false);  // leaves an empty root leaf
-    EXPECT_EQ(DumpOf(*map), "Height = 0\n{\n}\n");
-    EXPECT_EQ(map->GetNumNodes(), 1);
-    map->Validate();
+    Map::wFindRet ret;
+    map().wFind(ret, MakeKey(1), false);  // leaves an empty root leaf
+    EXPECT_EQ(Dump(), "Height = 0\n{\n}\n");
+    EXPECT_EQ(map().GetNumNodes(), 1);
+    map().Validate();
 }
 
 TEST_F(MapDiagnosticsTest, DumpIndentsChildBlocksAndPlacesSeparatorsBetweenThem) {
-    Guid site = MakeSite(0xabc);
-    for (uint64 i = 0; i < 101; ++i) {
-        (*map)[MakeKey(0, std::string(1, char(i)))].Insert(site, 5, int64(i) - 1);
+    for (int i = 0; i < 101; ++i) {
+        map()[MakeKey(0, std::string(1, char(i)))].Insert(MakeSite(0xabc), 5, i - 1);
     }
-    ASSERT_EQ(map->m_height, 1);
-    std::string s = "(00000abc-0000-0000-0000-000000000000,(5,";
+    ASSERT_EQ(map().m_height, 1);
     std::string expected = "Height = 1\n{\n    {\n";
-    for (int i = 0; i < 50; ++i) {
+    for (int i = 0; i < 101; ++i) {
         char hex[3];
         std::snprintf(hex, sizeof hex, "%02x", i);
-        expected +=
-            "        #0/" + std::string(hex) + " --> {" + s + std::to_string(i - 1) + "))}\n";
+        expected += std::string("        #0/") + hex +
+                    " --> {(00000abc-0000-0000-0000-000000000000,(5," + std::to_string(i - 1) +
+                    "))}\n" + (i == 49 ? "    }\n    #0/32\n    {\n" : "");
     }
-    expected += "    }\n    #0/32\n    {\n";
-    for (int i = 50; i < 101; ++i) {
-        char hex[3];
-        std::snprintf(hex, sizeof hex, "%02x", i);
-        expected +=
-            "        #0/" + std::string(hex) + " --> {" + s + std::to_string(i - 1) + "))}\n";
-    }
-    expected += "    }\n}\n";
-    EXPECT_EQ(DumpOf(*map), expected);
-    EXPECT_EQ(map->GetNumNodes(), 3);
-}
-
-TEST_F(MapDiagnosticsTest, NodeCountsFollowTheSeparators) {
-    for (uint64 i = 0; i < 201; ++i) {  // ascending: leaves of 50, 50, 50, 51
-        (*map)[MakeKey(i)];
-    }
-    ASSERT_EQ(map->m_height, 1);
-    auto* root = FieldIdToOffsetOpsOnInt64FieldMapAsInternalNode(map->m_root.Get());
-    EXPECT_EQ(map->GetNumNodes(), root->m_numKeyEntrys + 2);
-    EXPECT_EQ(root->m_numKeyEntrys, 3);
-    map->Validate();
+    EXPECT_EQ(Dump(), expected + "    }\n}\n");
+    EXPECT_EQ(map().GetNumNodes(), 3);
 }
 
 TEST_F(MapDiagnosticsTest, ValidationStopsAtTheFirstBrokenInvariant) {
-    for (uint64 i = 0; i < 150; ++i) {
-        (*map)[MakeKey(i)];
-    }
-    auto* root = FieldIdToOffsetOpsOnInt64FieldMapAsInternalNode(map->m_root.Get());
-    auto* left = FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(root->m_ptr.Get());
-    auto* right = FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(root->GetEntry(0).m_ptr.Get());
-
+    Fill(1, 201);  // leaves of 50, 50, 50 and 51 under a root with 3 keys
+    EXPECT_EQ(map().GetNumNodes(), 5);
+    Internal* root = Root();
+    Leaf* left = LeafAt(0);
+    Leaf* right = LeafAt(1);
     // A separator equal to the first key of its right leaf is fine; one that
-    // no leaf holds any more is fine too.
-    map->Validate();
+    // no leaf holds any more (the last leaf keeps 50) is fine too.
+    ASSERT_TRUE(map().Delete(K(151)));
+    map().Validate();
     EXPECT_TARN_ASSERT(
         {
             left->m_numKeyEntrys = 49;
-            map->Validate();
+            map().Validate();
         },
         "50 <= nk");
     EXPECT_TARN_ASSERT(
         {
             right->GetEntry(1).first = right->GetEntry(0).first;
-            map->Validate();
+            map().Validate();
         },
         "CompareKeys(leaf->GetEntry(i-1).first, leaf->GetEntry(i).first) < 0");
     EXPECT_TARN_ASSERT(
         {
             left->GetEntry(49).first = root->GetEntry(0).m_key;
-            map->Validate();
+            map().Validate();
         },
         "CompareKeys(leaf->GetEntry(nk-1).first, *k2) < 0");
     EXPECT_TARN_ASSERT(
         {
             right->GetEntry(0).first = left->GetEntry(0).first;
-            map->Validate();
+            map().Validate();
         },
         "CompareKeys(*k1, leaf->GetEntry(0).first) <= 0");
     // Broken leaf links and a wrong size are not the validator's business.
-    map->m_size = 7;
+    map().m_size = 7;
     left->m_next.Clear();
-    map->Validate();
+    map().Validate();
     left->m_next = right;
-    map->m_size = 150;
+    map().m_size = 200;
 }
 
 }  // namespace
