@@ -32,6 +32,8 @@
 #include "tnRuntime/ClassRegistry.h"
 #include "tnRuntime/MemoryStore.h"
 #include "tnRuntime/RuntimeCallLog.h"
+#include "tnUtils/Archive.h"
+#include "tnUtils/MemoryOutputStream.h"
 
 namespace tarn::testing {
 
@@ -220,6 +222,29 @@ std::vector<T> WithoutAt(std::vector<T> a, std::size_t i) {
     return a;
 }
 
+// ---- Byte images ----------------------------------------------------------------
+
+using Bytes = std::vector<octet_t>;
+
+// The image `obj` writes through its Serialise.
+template <typename T>
+Bytes ImageOf(const T& obj) {
+    MemoryOutputStream os;
+    auto ar = std::make_unique<Archive>(&os);
+    obj.Serialise(*ar);
+    ar->Flush();
+    return os.bytes();
+}
+
+// A 64-bit value as 8 bytes, least significant first.
+inline Bytes Le64(uint64 v) {
+    Bytes b;
+    for (int i = 0; i < 8; ++i) {
+        b.push_back(octet_t(v >> (8 * i)));
+    }
+    return b;
+}
+
 // ---- Runtime helpers ---------------------------------------------------------
 
 // Registers the three tree classes once per process, so that their images can
@@ -350,14 +375,6 @@ protected:
         Keys out;
         for (ssize_t i = 0; i < node->m_numKeyEntrys; ++i) {
             out.push_back(KeyNum(node->GetEntry(i).m_key));
-        }
-        return out;
-    }
-    // The children of an internal node, leftmost (m_ptr) first.
-    static std::vector<void*> Children(const Internal* node) {
-        std::vector<void*> out{node->m_ptr.Get()};
-        for (ssize_t i = 0; i < node->m_numKeyEntrys; ++i) {
-            out.push_back(node->GetEntry(i).m_ptr.Get());
         }
         return out;
     }

@@ -13,7 +13,6 @@
 
 #include "tests/AssertDeath.h"
 #include "tests/BTreeCheck.h"
-#include "tnPersistStore/btreemap.h"
 
 namespace tarn {
 namespace {
@@ -50,30 +49,29 @@ TEST_P(BTreeInsert, FirstKeyMakesRootLeafDeclaredReachableFromTheMap) {
     // The new leaf was queued by its registration, then the header was marked.
     EXPECT_EQ(CommitAndListWrites(), (Writes{Oid(leaf), Oid(&map())}));
     EXPECT_BTREE_OK(map());
-
-    Map* other = DollarNew(new Map());
-    Map::wFindRet ret;
-    other->wFind(ret, K(5), false);  // finds nothing, leaves an empty root leaf
-    EXPECT_TRUE(!ret.m_containingNode.m_self && !ret.m_payload && !ret.m_leaf);
-    EXPECT_TRUE(ret.m_index == -1 && !ret.m_created);
-    EXPECT_EQ(other->m_height, 0);
-    EXPECT_EQ(LeafCounts(*other), std::vector<ssize_t>{0});
-    EXPECT_BTREE_OK(*other);
 }
 
+// Splitting the last leaf of a root leaf: the new leaf becomes the last one,
+// a root grows, and each separator is the first key of the leaf to its right.
 TEST_P(BTreeInsert, AscendingKeysLeaveFiftyInEveryLeafButTheLast) {
-    const std::pair<uint64, std::vector<ssize_t>> steps[] = {
-        {100, {100}}, {101, {50, 51}}, {150, {50, 100}}, {151, {50, 50, 51}}};
-    uint64 done = 0;
-    for (const auto& [n, counts] : steps) {
-        Fill(done + 1, n);
-        done = n;
-        EXPECT_EQ(LeafCounts(map()), counts) << n << " keys";
-        EXPECT_BTREE_OK(map());
-    }
-    // Each separator is the first key of the leaf to its right.
-    EXPECT_EQ(Separators(Root()), (Keys{51 * kGap, 101 * kGap}));
-    EXPECT_EQ(Children(Root()), (std::vector<void*>{LeafAt(0), LeafAt(1), LeafAt(2)}));
+    Fill(1, 100);
+    EXPECT_EQ(LeafCounts(map()), std::vector<ssize_t>{100});
+    Leaf* left = LeafAt(0);
+    Commit();
+    Put(101 * kGap);
+    Leaf* right = map().m_lastLeaf.Get();
+    EXPECT_EQ(LeafCounts(map()), (std::vector<ssize_t>{50, 51}));
+    EXPECT_EQ(Log().numDeclareReachable, 2);  // the leaf from its left, the root from the map
+    EXPECT_EQ(Log().lastReachableFrom.m_self, &map());
+    EXPECT_EQ(Log().lastReachableTo.m_self, Root());
+    EXPECT_EQ(CommitAndListWrites(), (Writes{Oid(&map()), Oid(right), Oid(left), Oid(Root())}));
+    Fill(102, 150);
+    EXPECT_EQ(LeafCounts(map()), (std::vector<ssize_t>{50, 100}));
+    Fill(151, 151);
+    EXPECT_EQ(LeafCounts(map()), (std::vector<ssize_t>{50, 50, 51}));
+    EXPECT_EQ(EntriesOf(Root()),
+              One(0, left) + One(51 * kGap, right) + One(101 * kGap, map().m_lastLeaf.Get()));
+    EXPECT_BTREE_OK(map());
 }
 
 TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
@@ -101,27 +99,6 @@ TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
 }
 
 // ---- Dirty marks and reachability per event ------------------------------------
-
-TEST_P(BTreeInsert, KeyPlacedWithoutSplitMarksHeaderThenLeaf) {
-    Fill(1, 10);
-    Commit();
-    map()[Key(5 * kGap + 1)].Insert(MakeSite(1), 3, 4);
-    EXPECT_EQ(Log().numDeclareReachable + Log().numRegisterGcObject, 0);
-    EXPECT_EQ(CommitAndListWrites(), (Writes{Oid(&map()), Oid(LeafAt(0))}));
-}
-
-TEST_P(BTreeInsert, SplittingLastLeafMakesNewLeafTheLastAndGrowsARoot) {
-    Fill(1, 100);
-    Leaf* left = LeafAt(0);
-    Commit();
-    Put(101 * kGap);
-    Leaf* right = left->m_next.Get();
-    EXPECT_EQ(map().m_lastLeaf.Get(), right);
-    EXPECT_EQ(Log().numDeclareReachable, 2);  // the leaf from its left, the root from the map
-    EXPECT_EQ(Log().lastReachableFrom.m_self, &map());
-    EXPECT_EQ(Log().lastReachableTo.m_self, Root());
-    EXPECT_EQ(CommitAndListWrites(), (Writes{Oid(&map()), Oid(right), Oid(left), Oid(Root())}));
-}
 
 TEST_P(BTreeInsert, SplittingMiddleLeafRelinksItsSuccessor) {
     Fill(1, 150);  // leaves of 50 and 100
@@ -202,8 +179,12 @@ TEST_P(BTreeInsert, PresentKeysKeepOrReplaceTheirPayload) {
     EXPECT_EQ(CommitAndListWrites(), Writes{Oid(leaf)});
 
     EXPECT_EQ(map()[K(7)], MakePayload(7 * kGap));
-    EXPECT_EQ(map().m_size, 20);
     EXPECT_EQ(CommitAndListWrites(), Writes{Oid(leaf)});
+
+    // A new key without a split: the header (its count), then the leaf.
+    map()[Key(5 * kGap + 1)].Insert(MakeSite(1), 3, 4);
+    EXPECT_EQ(Log().numDeclareReachable + Log().numRegisterGcObject, 0);
+    EXPECT_EQ(CommitAndListWrites(), (Writes{Oid(&map()), Oid(leaf)}));
 }
 
 // ---- Whole-map operations -------------------------------------------------------
@@ -267,6 +248,33 @@ TEST_P(BTreeInsert, CopiesShareNoNodeAndEqualityComparesEntriesOnly) {
     EXPECT_FALSE(Map() == map());
 }
 
+// The runtime copies nodes in place through their records' type operations.
+TEST_P(BTreeInsert, NodeCopiesThroughTypeOperationsAreDeep) {
+    Fill(1, 101);
+    Leaf* src = LeafAt(0);
+    const TypeOps* ops = _GetTypeOps(static_cast<const Leaf*>(nullptr));
+    alignas(Leaf) unsigned char raw[sizeof(Leaf)];
+    ops->m_CopyConstructArrayFn(raw, sizeof(Leaf), src, sizeof(Leaf), 1);
+    Leaf& copy = *reinterpret_cast<Leaf*>(raw);
+    EXPECT_EQ(LeafKeys(&copy), LeafKeys(src));
+    for (ssize_t i = 0; i < 50; ++i) {
+        EXPECT_EQ(copy.GetEntry(i).second, src->GetEntry(i).second);
+        EXPECT_NE(copy.GetEntry(i).first.path.data(), src->GetEntry(i).first.path.data());
+    }
+    copy.GetEntry(0).second.Insert(MakeSite(9), 5, 5);
+    EXPECT_EQ(src->GetEntry(0).second, MakePayload(1 * kGap));
+    Map* small = DollarNew(new Map());
+    small->Insert(K(7), MakePayload(7), false);
+    ops->m_AssignArrayFn(raw, sizeof(Leaf), small->m_firstLeaf.Get(), sizeof(Leaf), 1);
+    copy = copy;
+    EXPECT_EQ(LeafKeys(&copy), Keys{7 * kGap});
+    ops->m_DestructArrayFn(raw, sizeof(Leaf), 1);
+
+    Internal nodeCopy(*Root());
+    EXPECT_EQ(EntriesOf(&nodeCopy), EntriesOf(Root()));
+    EXPECT_NE(nodeCopy.GetEntry(0).m_key.path.data(), Root()->GetEntry(0).m_key.path.data());
+}
+
 TEST_P(BTreeInsert, EqualityStopsOnSizeThatDisagreesWithLeaves) {
     Fill(1, 3);
     Map* shorter = DollarNew(new Map());
@@ -306,22 +314,6 @@ TEST_P(BTreeInsert, AssignmentBuildsNewTreeAlsoForSelfAndSwapTwiceRestores) {
     EXPECT_EQ(map().m_firstLeaf.Get(), mine);
     EXPECT_EQ(other->m_firstLeaf.Get(), theirs);
     EXPECT_BTREE_OK(*other);
-}
-
-TEST_P(BTreeInsert, HandleCreatesForwardsAndClears) {
-    btreemap<Map> handle;
-    EXPECT_FALSE(handle);
-    handle.OnCreate(true);
-    ASSERT_TRUE(handle);
-    handle[K(1)].Insert(MakeSite(1), 1, 5);
-    handle[K(2)];
-    EXPECT_EQ(handle.size(), 2);
-    EXPECT_EQ(handle.count(K(1)), 1);
-    EXPECT_EQ(*handle.find_2(K(1)), MakePayload(5));
-    EXPECT_TRUE(handle.find(K(3)) == handle.end());
-    handle.clear();
-    EXPECT_TRUE(handle.empty());
-    EXPECT_EQ(handle->m_height, -1);
 }
 
 }  // namespace

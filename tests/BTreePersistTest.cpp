@@ -6,12 +6,10 @@
 #include <gtest/gtest.h>
 
 #include <initializer_list>
-#include <memory>
 #include <vector>
 
 #include "tests/AssertDeath.h"
 #include "tests/BTreeCheck.h"
-#include "tnUtils/MemoryOutputStream.h"
 
 namespace tarn {
 namespace {
@@ -20,30 +18,16 @@ using testing::MakeKey;
 using testing::MakeSite;
 using testing::Oid;
 using testing::operator+;
-using Bytes = std::vector<octet_t>;
+using testing::Bytes;
+using testing::ImageOf;
+using testing::Le64;
 
 // Pieces of expected images, joined with +.
 Bytes U8(std::initializer_list<int> v) {
     return Bytes(v.begin(), v.end());
 }
-Bytes Le64(uint64 v) {
-    Bytes b;
-    for (int i = 0; i < 8; ++i) {
-        b.push_back(octet_t(v >> (8 * i)));
-    }
-    return b;
-}
 Bytes KeyBytes(const FieldId& k) {  // identity, path length, path bytes
     return Le64(k.oid.value_) + U8({int(k.path.size())}) + Bytes(k.path.begin(), k.path.end());
-}
-
-template <typename T>
-Bytes ImageOf(const T& obj) {
-    MemoryOutputStream os;
-    auto ar = std::make_unique<Archive>(&os);
-    obj.Serialise(*ar);
-    ar->Flush();
-    return os.bytes();
 }
 
 // Read into `into`, `image` is consumed to its end and written back unchanged.
