@@ -143,7 +143,7 @@ TEST(ArchiveImage, ValuesAreExactAndReadBackToTheirEnd) {
     ExpectImage(AsCompressedInt<int64>(300), {0xac, 0x02}, CompressedInt<int64>(0));
     const std::string longPath(200, 'p');
     Bytes keyBytes = {8, 7, 6, 5, 4, 3, 2, 1, 0xc8, 0x01};  // oid, path length, path bytes
-    keyBytes.insert(keyBytes.end(), longPath.begin(), longPath.end());
+    keyBytes.resize(keyBytes.size() + longPath.size(), 'p');
     ExpectImage(FieldId(OID(Seid(0x0102030405060708u)), Path(longPath.data(), 200)), keyBytes,
                 FieldId(OID(Seid(9u)), Path(longPath.data(), 150)));
 }
