@@ -4,6 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <iterator>
+
 #include <cstdint>
 #include <functional>
 #include <numeric>
@@ -142,8 +145,9 @@ TEST(ArchiveImage, ValuesAreExactAndReadBackToTheirEnd) {
                 {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16}, Guid{});
     ExpectImage(AsCompressedInt<int64>(300), {0xac, 0x02}, CompressedInt<int64>(0));
     const std::string longPath(200, 'p');
-    Bytes keyBytes = {8, 7, 6, 5, 4, 3, 2, 1, 0xc8, 0x01};  // oid, path length, path bytes
-    keyBytes.resize(keyBytes.size() + longPath.size(), 'p');
+    const octet_t head[] = {8, 7, 6, 5, 4, 3, 2, 1, 0xc8, 0x01};  // oid, path length
+    Bytes keyBytes(sizeof head + longPath.size(), 'p');           // then the path bytes
+    std::copy(std::begin(head), std::end(head), keyBytes.begin());
     ExpectImage(FieldId(OID(Seid(0x0102030405060708u)), Path(longPath.data(), 200)), keyBytes,
                 FieldId(OID(Seid(9u)), Path(longPath.data(), 150)));
 }
