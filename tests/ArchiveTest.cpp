@@ -5,10 +5,9 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <iterator>
-
 #include <cstdint>
 #include <functional>
+#include <iterator>
 #include <numeric>
 #include <random>
 #include <string>
