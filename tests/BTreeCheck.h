@@ -143,6 +143,8 @@ private:
     }
 
     // Invariants 3 to 5 for one node; `rootMin` is the least count of a root.
+    // Walks lo, key 0, ..., key nk-1, hi: each must be below the next, except
+    // that the first key may equal lo.
     template <typename N>
     bool Keys(const N* n, ssize_t rootMin, const FieldId* lo, const FieldId* hi,
               const std::string& where) {
@@ -150,19 +152,13 @@ private:
         if (nk < (lo || hi ? 50 : rootMin) || nk > 100) {
             return Fail(where + " holds " + std::to_string(nk) + " entries");
         }
-        for (ssize_t i = 1; i < nk; ++i) {
-            if (CompareKeys(KeyOf(n, i - 1), KeyOf(n, i)) >= 0) {
-                return Fail(where + ": keys " + std::to_string(i - 1) + " and " +
-                            std::to_string(i) + " out of order");
+        for (ssize_t i = 0; i <= nk && nk > 0; ++i) {
+            const FieldId* a = i == 0 ? lo : &KeyOf(n, i - 1);
+            const FieldId* b = i == nk ? hi : &KeyOf(n, i);
+            if (a && b && CompareKeys(*a, *b) >= (i == 0 ? 1 : 0)) {
+                return Fail(where + ": " + KeyText(*a) + " not below " + KeyText(*b) +
+                            " at position " + std::to_string(i));
             }
-        }
-        if (nk > 0 && lo && CompareKeys(*lo, KeyOf(n, 0)) > 0) {
-            return Fail(where + ": first key " + KeyText(KeyOf(n, 0)) + " below separator " +
-                        KeyText(*lo));
-        }
-        if (nk > 0 && hi && CompareKeys(KeyOf(n, nk - 1), *hi) >= 0) {
-            return Fail(where + ": last key " + KeyText(KeyOf(n, nk - 1)) +
-                        " not below separator " + KeyText(*hi));
         }
         return true;
     }
@@ -344,13 +340,6 @@ protected:
             Put(i * kGap);
         }
     }
-    // Every entry still carries the payload written with its key by Put.
-    void ExpectPayloadsFollowKeys() {
-        for (auto it = static_cast<const Map&>(map()).begin(); it != map().end(); ++it) {
-            EXPECT_EQ(it->second, MakePayload(int64(KeyNum(it->first))));
-        }
-    }
-
     static Internal* AsInternal(void* n) {
         return FieldIdToOffsetOpsOnInt64FieldMapAsInternalNode(n);
     }
@@ -389,13 +378,38 @@ protected:
         return out;
     }
     static Entries One(uint64 key, void* child) { return {{key, child}}; }
-    // Every key number of the map, in iteration order.
+    // Every key number of the map, in iteration order; each entry must still
+    // carry the payload that Put gave its key.
     Keys AllKeys() {
         Keys out;
         for (auto it = static_cast<const Map&>(map()).begin(); it != map().end(); ++it) {
             out.push_back(KeyNum(it->first));
+            EXPECT_EQ(it->second, MakePayload(int64(out.back())));
         }
         return out;
+    }
+
+    // Before a commit: the header and every node that is not dirty still
+    // equal their images in the store, so nothing changed without a mark.
+    void ExpectNoUnmarkedChange() { ExpectUnmarked(map().m_height, map().m_root.Get()); }
+    template <typename T>
+    void ExpectUnchanged(const T* obj) {
+        const auto stored = m_store->Load(Oid(obj));
+        EXPECT_TRUE(obj->IsDirty() || (stored && stored->bytes == ImageOf(*obj)))
+            << "#" << Oid(obj) << " changed without a dirty mark";
+    }
+    void ExpectUnmarked(ssize_t height, void* node) {
+        if (height == map().m_height) {
+            ExpectUnchanged(&map());
+        }
+        if (height == 0) {
+            ExpectUnchanged(AsLeaf(node));
+        } else if (height > 0) {
+            ExpectUnchanged(AsInternal(node));
+            for (const auto& entry : EntriesOf(AsInternal(node))) {
+                ExpectUnmarked(height - 1, entry.second);
+            }
+        }
     }
 
     std::shared_ptr<RecordingStore> m_store;

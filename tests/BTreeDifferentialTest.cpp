@@ -219,11 +219,13 @@ protected:
         ASSERT_TRUE(it == map().end());
     }
 
-    // The nodes handed over since the last commit are exactly the queued
-    // deletions, and the commit destroys exactly them. Every `m_evictEvery`
+    // Nothing changed without a dirty mark; the nodes handed over since the
+    // last commit are exactly the queued deletions, and the commit destroys
+    // exactly them. Every `m_evictEvery`
     // commits, every resident is released, the header too, so that the next
     // operations load the nodes they touch (neighbours too).
     void CommitAndCheck(bool evict = false) {
+        ASSERT_NO_FATAL_FAILURE(ExpectNoUnmarkedChange());
         const int64 dropped = Log().numAsyncDeleteObject - m_droppedAtCommit;
         ASSERT_EQ(m_space.NumQueuedDeletions(), dropped);
         const int64 deletedBefore = m_space.Stats().numDeleted;

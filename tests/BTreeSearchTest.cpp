@@ -22,14 +22,12 @@ protected:
     const Map& cmap() { return map(); }
     static const Policy& P(const Map::const_iterator& it) { return it.policy(); }
 
-    // begin, end, and find, lower_bound and upper_bound of any key all stand
-    // at `at`.
+    // begin, end, and find, lower_bound and upper_bound of a key all stand at
+    // `at`.
     void ExpectEverythingAt(const Policy& at) {
-        for (uint64 i : {0u, 1u, 2u}) {
-            EXPECT_TRUE(P(cmap().find(K(i))) == at);
-            EXPECT_TRUE(P(cmap().lower_bound(K(i))) == at);
-            EXPECT_TRUE(P(cmap().upper_bound(K(i))) == at);
-        }
+        EXPECT_TRUE(P(cmap().find(K(1))) == at);
+        EXPECT_TRUE(P(cmap().lower_bound(K(1))) == at);
+        EXPECT_TRUE(P(cmap().upper_bound(K(1))) == at);
         EXPECT_TRUE(P(cmap().begin()) == at);
         EXPECT_TRUE(P(cmap().end()) == at);
         EXPECT_TRUE(cmap().rbegin() == cmap().rend());
