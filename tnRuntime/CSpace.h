@@ -130,7 +130,8 @@ public:
     void Commit();
     // Releases every clean resident; returns how many.
     ssize_t DropCleanResidents() { return EvictCleanResidents(0); }
-    // Releases clean residents, least recently loaded or registered first,
+    // Releases clean residents, those without children along VisitPrefs
+    // before inner ones, each kind least recently loaded or registered first,
     // until at most `maxResidents` remain or none is clean; returns how many.
     ssize_t EvictCleanResidents(ssize_t maxResidents);
     // After each commit that leaves more than `maxResidents` residents,

@@ -4,6 +4,7 @@
 #include <algorithm>
 
 #include "tnObject/IObjectVisitor.h"
+#include "tnPersistStore/IPrefVisitor.h"
 #include "tnPersistStore/pref.h"
 #include "tnRuntime/CSpace.h"
 
@@ -26,6 +27,22 @@ public:
 
 private:
     const std::unordered_set<const void*>& m_objects;
+};
+
+// Whether an object reports any edge of the persistent tree below it.
+class HasChildren final : public IPrefVisitor {
+public:
+    void VisitPref(const prefbase& ref) override { m_any = m_any || static_cast<bool>(ref); }
+    void VisitParentPref(const prefbase&) override {}
+
+    static bool Of(const ptr<IPersistable>& obj) {
+        HasChildren v;
+        obj->VisitPrefs(v);
+        return v.m_any;
+    }
+
+private:
+    bool m_any = false;
 };
 
 }  // namespace
@@ -55,17 +72,26 @@ ssize_t CSpace::EvictCleanResidents(ssize_t maxResidents) {
         if (excess <= 0) {
             return 0;
         }
+        // Victims, in order: objects without children in the persistent tree
+        // (the leaves of a B+tree, say) before inner ones, whose reload
+        // would cost a load for every walk down through them; within each,
+        // the earliest loaded or registered first.
+        std::vector<std::pair<bool, const Resident*>> candidates;
         for (const auto& [oid, resident] : m_residents) {
             const ObjSysState& state = resident.obj->GetSysState();
             if (!state.GetFlag(DBP_PO_DIRTY) &&
                 !state.GetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION)) {
-                clean.push_back(&resident);
+                candidates.emplace_back(HasChildren::Of(resident.obj), &resident);
             }
         }
-        std::sort(clean.begin(), clean.end(),
-                  [](const Resident* a, const Resident* b) { return a->tick < b->tick; });
-        if (static_cast<ssize_t>(clean.size()) > excess) {
-            clean.resize(static_cast<std::size_t>(excess));
+        std::sort(candidates.begin(), candidates.end(), [](const auto& a, const auto& b) {
+            return a.first != b.first ? b.first : a.second->tick < b.second->tick;
+        });
+        for (const auto& [inner, resident] : candidates) {
+            if (static_cast<ssize_t>(clean.size()) == excess) {
+                break;
+            }
+            clean.push_back(resident);
         }
     }
     std::vector<ptr<IPersistable>> victims;
