@@ -1,8 +1,8 @@
 #pragma once
 
 // The one invariant checker of the B+tree map, shared by every test that
-// changes a tree, plus key and payload makers and a fixture with a space and a
-// map for those tests.
+// changes a tree, plus what those tests build with: key and payload makers,
+// byte-image helpers, and a fixture with a space, a map and shape helpers.
 //
 // CheckBTree walks the whole tree (loading nodes as needed) and returns a
 // description of the first broken invariant, or "" when all hold:
@@ -391,25 +391,26 @@ protected:
 
     // Before a commit: the header and every node that is not dirty still
     // equal their images in the store, so nothing changed without a mark.
-    void ExpectNoUnmarkedChange() { ExpectUnmarked(map().m_height, map().m_root.Get()); }
-    template <typename T>
-    void ExpectUnchanged(const T* obj) {
-        const auto stored = m_store->Load(Oid(obj));
-        EXPECT_TRUE(obj->IsDirty() || (stored && stored->bytes == ImageOf(*obj)))
-            << "#" << Oid(obj) << " changed without a dirty mark";
-    }
-    void ExpectUnmarked(ssize_t height, void* node) {
-        if (height == map().m_height) {
+    void ExpectNoUnmarkedChange(ssize_t height = -2, void* node = nullptr) {
+        if (height == -2) {
             ExpectUnchanged(&map());
+            height = map().m_height;
+            node = map().m_root.Get();
         }
         if (height == 0) {
             ExpectUnchanged(AsLeaf(node));
         } else if (height > 0) {
             ExpectUnchanged(AsInternal(node));
             for (const auto& entry : EntriesOf(AsInternal(node))) {
-                ExpectUnmarked(height - 1, entry.second);
+                ExpectNoUnmarkedChange(height - 1, entry.second);
             }
         }
+    }
+    template <typename T>
+    void ExpectUnchanged(const T* obj) {
+        const auto stored = m_store->Load(Oid(obj));
+        EXPECT_TRUE(obj->IsDirty() || (stored && stored->bytes == ImageOf(*obj)))
+            << "#" << Oid(obj) << " changed without a dirty mark";
     }
 
     std::shared_ptr<RecordingStore> m_store;

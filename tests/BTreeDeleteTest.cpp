@@ -31,8 +31,9 @@ using testing::WithoutAt;
 
 class BTreeDelete : public testing::BTreeSpaceTest {
 protected:
-    static OID IdOf(const void* node) {
-        return static_cast<const Leaf*>(node)->GetPersistObjState().m_oid;
+    template <typename T>
+    static OID IdOf(const T* node) {
+        return node->GetPersistObjState().m_oid;
     }
 
     // The nodes `ids` (in hand-over order) and no others were handed to
@@ -214,7 +215,7 @@ TEST_F(BTreeDeleteHeight2, LeftmostChildAbsorbsRightSiblingWhenLeftNeighbourIsCo
     EXPECT_EQ(EntriesOf(p2), One(0, e2[0].second) + Slice(e2, 2, 61));
     EXPECT_EQ(Separators(Root()), Keys{rootKey});
     EXPECT_EQ(t->m_prev->m_numKeyEntrys, 50);
-    ExpectDroppedUntilCommit({IdOf(e2[1].second)});
+    ExpectDroppedUntilCommit({IdOf(AsLeaf(e2[1].second))});
 }
 
 TEST_F(BTreeDeleteHeight2, InternalNodeOf49MergesIntoExactly100) {
@@ -223,7 +224,7 @@ TEST_F(BTreeDeleteHeight2, InternalNodeOf49MergesIntoExactly100) {
     Leaf* leaf59 = AsLeaf(e2[8].second);
     const Keys keys59 = LeafKeys(leaf59);
     const Keys keys60 = LeafKeys(AsLeaf(e2[9].second));  // K(3001) .. K(3050)
-    const std::vector<OID> dropped{IdOf(e2[9].second), IdOf(p2), IdOf(oldRoot)};
+    const std::vector<OID> dropped{IdOf(AsLeaf(e2[9].second)), IdOf(p2), IdOf(oldRoot)};
     // Leaf 60 (p2's entry 8) merges into leaf 59; p2 falls to 49 keys and
     // merges into p1; the root is left without keys and collapses.
     EXPECT_TRUE(map().Delete(K(3025)));
@@ -257,7 +258,7 @@ TEST_F(BTreeDeleteHeight2, InternalBalanceFromLeftMovesFiveKeys) {
     EXPECT_EQ(Separators(Root()), Keys{e1[56].first});
     EXPECT_EQ(EntriesOf(p2), One(0, e1[56].second) + Slice(e1, 57, 61) +
                                  One(rootKey, e2[0].second) + WithoutAt(Slice(e2, 1, 51), 8));
-    ExpectDroppedUntilCommit({IdOf(e2[9].second)});
+    ExpectDroppedUntilCommit({IdOf(AsLeaf(e2[9].second))});
 }
 
 TEST_F(BTreeDeleteHeight2, InternalBalanceFromRightMovesFiveKeys) {
@@ -271,7 +272,7 @@ TEST_F(BTreeDeleteHeight2, InternalBalanceFromRightMovesFiveKeys) {
     EXPECT_EQ(EntriesOf(p1), WithoutAt(e1, 10) + One(rootKey, e2[0].second) + Slice(e2, 1, 5));
     EXPECT_EQ(Separators(Root()), Keys{e2[5].first});
     EXPECT_EQ(EntriesOf(p2), One(0, e2[5].second) + Slice(e2, 6, 61));
-    ExpectDroppedUntilCommit({IdOf(e1[10].second)});
+    ExpectDroppedUntilCommit({IdOf(AsLeaf(e1[10].second))});
 }
 
 // ---- Broken preconditions of the single steps stop the process ------------------

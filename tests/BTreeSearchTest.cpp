@@ -92,6 +92,7 @@ TEST_F(BTreeSearch, SteppingBeforeBeginComesBackAndMisuseStops) {
     EXPECT_TARN_ASSERT((void)*end, "0 <= m_offset && m_offset < m_leaf->m_numKeyEntrys");
     Map::iterator mend = map().end();
     EXPECT_TARN_ASSERT((void)*mend, "0 <= m_offset && m_offset < m_leaf->m_numKeyEntrys");
+    EXPECT_TARN_ASSERT(map().SearchLeaf(K(1), nullptr), "leaf");
 }
 
 TEST_F(BTreeSearch, OnlyMutableDereferenceMarksTheLeaf) {

@@ -54,7 +54,7 @@ TEST_F(OffsetOpsTest, NewRecordRefersToAnEmptyMapAndPrintsOnlyItsReference) {
     ASSERT_NE(map, nullptr);
     const uint64 mapId = map->GetPersistObjState().m_oid.value_;
     EXPECT_EQ(ImageOf(*rec), Bytes{0x01} + Le64(mapId));
-    EXPECT_EQ(ImageOf(*map), (Bytes{0x01, 0x00} + Le64(0) + Le64(0) + Le64(0) + Bytes{0x00}));
+    EXPECT_TRUE(map->empty());  // its image: see the map's persistence tests
     rec->RecordOffset(Op(1, 5), MakeKey(1), 12);
     EXPECT_EQ(TextOf([&](xostream& os) { os << *rec; }), "#" + std::to_string(mapId));
 
