@@ -16,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
@@ -23,7 +24,6 @@
 #include "tnRuntime/ImageRecord.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/MemoryOutputStream.h"
-#include "tools/TreeCheck.h"
 
 namespace tarn::fuzz {
 
@@ -94,7 +94,7 @@ inline void Exercise(ptr<IPersistable> obj, int maxSteps) {
     } else if (rc == &GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMap>()) {
         map = static_cast<const FieldIdToOffsetOpsOnInt64FieldMap*>(obj.m_self);
     }
-    if (map == nullptr || !tool::CheckTree(*map).Ok()) {
+    if (map == nullptr || !FieldIdToOffsetOpsOnInt64FieldMapCheck(*map).Ok()) {
         return;
     }
     int steps = 0;

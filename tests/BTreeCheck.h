@@ -1,21 +1,9 @@
 #pragma once
 
-// The one invariant checker of the B+tree map, shared by every test that
-// changes a tree, plus what those tests build with: key and payload makers,
-// byte-image helpers, and a fixture with a space, a map and shape helpers.
-//
-// CheckBTree walks the whole tree (loading nodes as needed) and returns a
-// description of the first broken invariant, or "" when all hold:
-//   1. height -1 <=> no root; then no first/last leaf and size 0
-//   2. height 0: root, first and last leaf are the same leaf
-//   3. fill: root leaf 0..100, internal root 1..100, every other node 50..100
-//   4. keys strictly increase inside every node
-//   5. every key of a subtree lies in the bounds its ancestors' separators
-//      give it (inclusive below, exclusive above)
-//   6. the leaves in tree order are exactly the chain m_firstLeaf ->m_next..
-//      m_lastLeaf, with m_prev linking it backwards and null ends; all leaves
-//      sit at the same depth (they are reached at height 0 only)
-//   7. m_size is the total of the leaves' counts
+// What every tree test builds with: CheckBTree (the map's own non-aborting
+// invariant checker, FieldIdToOffsetOpsOnInt64FieldMapCheck.h, reduced to
+// its first problem), key and payload makers, byte-image helpers, and a
+// fixture with a space, a map and shape helpers.
 
 #include <gtest/gtest.h>
 
@@ -27,6 +15,7 @@
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/ClassRegistry.h"
@@ -84,113 +73,11 @@ inline std::string KeyText(const FieldId& k) {
     return os.str();
 }
 
-class BTreeChecker {
-public:
-    using Map = FieldIdToOffsetOpsOnInt64FieldMap;
-    using Leaf = FieldIdToOffsetOpsOnInt64FieldMapLeafNode;
-    using Internal = FieldIdToOffsetOpsOnInt64FieldMapInternalNode;
-
-    explicit BTreeChecker(const Map& m) : m_map(m) {}
-
-    std::string Run() {
-        const Map& m = m_map;
-        void* root = m.m_height >= 0 ? m.m_root.Get() : nullptr;
-        if (m.m_height == -1) {
-            if (m.m_root || m.m_firstLeaf || m.m_lastLeaf || m.m_size != 0) {
-                Fail("height -1 with a root, a first or last leaf or a size");
-            }
-        } else if (!root) {
-            Fail("height " + std::to_string(m.m_height) + " without a root");
-        } else if (m.m_height == 0 && (m.m_firstLeaf.Get() != root || m.m_lastLeaf.Get() != root)) {
-            Fail("root leaf is not both first and last leaf");
-        } else if (Node(m.m_height, root, nullptr, nullptr)) {
-            Chain();
-        }
-        return m_error;
-    }
-
-private:
-    bool Fail(const std::string& what) {
-        m_error = m_error.empty() ? what : m_error;
-        return false;
-    }
-    static const FieldId& KeyOf(const Leaf* n, ssize_t i) { return n->GetEntry(i).first; }
-    static const FieldId& KeyOf(const Internal* n, ssize_t i) { return n->GetEntry(i).m_key; }
-
-    // Checks the subtree of `node`, whose keys must lie in [lo, hi).
-    bool Node(ssize_t height, void* node, const FieldId* lo, const FieldId* hi) {
-        if (!node) {
-            return Fail("null child at height " + std::to_string(height));
-        }
-        if (height == 0) {
-            auto* leaf = static_cast<Leaf*>(node);
-            m_leaves.push_back(leaf);
-            m_total += leaf->m_numKeyEntrys;
-            return Keys(leaf, 0, lo, hi, "leaf #" + std::to_string(m_leaves.size() - 1));
-        }
-        auto* in = static_cast<Internal*>(node);
-        if (!Keys(in, 1, lo, hi, "internal node at height " + std::to_string(height)) ||
-            !Node(height - 1, in->m_ptr.Get(), lo, &KeyOf(in, 0))) {
-            return false;
-        }
-        for (ssize_t i = 0, nk = in->m_numKeyEntrys; i < nk; ++i) {
-            if (!Node(height - 1, in->GetEntry(i).m_ptr.Get(), &KeyOf(in, i),
-                      i + 1 < nk ? &KeyOf(in, i + 1) : hi)) {
-                return false;
-            }
-        }
-        return true;
-    }
-
-    // Invariants 3 to 5 for one node; `rootMin` is the least count of a root.
-    // Walks lo, key 0, ..., key nk-1, hi: each must be below the next, except
-    // that the first key may equal lo.
-    template <typename N>
-    bool Keys(const N* n, ssize_t rootMin, const FieldId* lo, const FieldId* hi,
-              const std::string& where) {
-        const ssize_t nk = n->m_numKeyEntrys;
-        if (nk < (lo || hi ? 50 : rootMin) || nk > 100) {
-            return Fail(where + " holds " + std::to_string(nk) + " entries");
-        }
-        for (ssize_t i = 0; i <= nk && nk > 0; ++i) {
-            const FieldId* a = i == 0 ? lo : &KeyOf(n, i - 1);
-            const FieldId* b = i == nk ? hi : &KeyOf(n, i);
-            if (a && b && CompareKeys(*a, *b) >= (i == 0 ? 1 : 0)) {
-                return Fail(where + ": " + KeyText(*a) + " not below " + KeyText(*b) +
-                            " at position " + std::to_string(i));
-            }
-        }
-        return true;
-    }
-
-    void Chain() {
-        const Map& m = m_map;
-        if (m.m_firstLeaf.Get() != m_leaves.front() || m.m_lastLeaf.Get() != m_leaves.back()) {
-            Fail("m_firstLeaf or m_lastLeaf is not the outermost leaf");
-        } else if (m_leaves.front()->m_prev || m_leaves.back()->m_next) {
-            Fail("the leaf chain goes on past the outermost leaves");
-        } else if (m.m_size != m_total) {
-            Fail("m_size " + std::to_string(m.m_size) + " but leaves hold " +
-                 std::to_string(m_total));
-        }
-        for (std::size_t i = 0; i + 1 < m_leaves.size(); ++i) {
-            if (m_leaves[i]->m_next.Get() != m_leaves[i + 1] ||
-                m_leaves[i + 1]->m_prev.Get() != m_leaves[i]) {
-                Fail("leaves #" + std::to_string(i) + " and #" + std::to_string(i + 1) +
-                     " are not linked both ways");
-            }
-        }
-    }
-
-    const Map& m_map;
-    std::vector<Leaf*> m_leaves;
-    ssize_t m_total = 0;
-    std::string m_error;
-};
-
-// "" when every invariant holds, else what broke first.
+// "" when every invariant holds, else what broke first (the map's own
+// non-aborting checker).
 inline std::string CheckBTree(const FieldIdToOffsetOpsOnInt64FieldMap& m) {
-    return BTreeChecker(m).Run();
+    FieldIdToOffsetOpsOnInt64FieldMapCheckResult check = FieldIdToOffsetOpsOnInt64FieldMapCheck(m);
+    return check.Ok() ? std::string() : check.problems.front();
 }
 
 // The entry counts of the leaves, first to last, following the chain.

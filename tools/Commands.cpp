@@ -9,6 +9,7 @@
 #include <iostream>
 #include <set>
 
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/LmdbStore.h"
 #include "tnRuntime/RuntimeError.h"
@@ -16,7 +17,6 @@
 #include "tools/CountingStore.h"
 #include "tools/OstreamOutputStream.h"
 #include "tools/Reachability.h"
-#include "tools/TreeCheck.h"
 #include "tools/TreeWalk.h"
 
 namespace tarn::tool {
@@ -101,7 +101,8 @@ void LoadPathChecked(const Map& map, const FieldId& key) {
 
 // Refuses a tree that the map's own code could not walk safely.
 void RequireSoundTree(const Map& map) {
-    TreeCheckResult check = CheckTree(map);
+    FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
+        FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
     if (!check.Ok()) {
         throw RuntimeError("the stored tree is damaged (" + std::to_string(check.numProblems) +
                            " problems; the first: " + check.problems.front() +
@@ -350,7 +351,8 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
         Row(out, "record", Id(recordOid) + " (map " + Id(record->m_map.m_oid) + ")");
         Row(out, "fields", std::to_string(map.size()));
         Row(out, "height", std::to_string(map.m_height));
-        TreeCheckResult check = CheckTree(map);
+        FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
+            FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
         Row(out, "nodes", NodesText(check.leaves, check.internalNodes));
         problems = check.problems;
         numProblems = check.numProblems;

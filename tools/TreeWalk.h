@@ -9,7 +9,7 @@
 // bound), so that loading the next node keeps within the bound. Each node
 // is loaded with the class its level requires; an image of another class, a
 // missing image or a missing child reference ends the walk with a
-// RuntimeError. The walk checks nothing else (see TreeCheck.h).
+// RuntimeError. The walk checks nothing else (see FieldIdToOffsetOpsOnInt64FieldMapCheck.h).
 //
 // Run it holding the map's space: exclusively when bound > 0 (eviction needs
 // it), with either lock otherwise. Leaves are visited in key order.

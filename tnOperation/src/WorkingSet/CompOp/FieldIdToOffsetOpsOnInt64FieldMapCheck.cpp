@@ -1,18 +1,28 @@
-#include "tools/TreeCheck.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 
 #include <unordered_set>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnRuntime/RuntimeError.h"
-#include "tools/OpsFile.h"
+#include "tnUtils/xostream.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 namespace {
 
 using Map = FieldIdToOffsetOpsOnInt64FieldMap;
 using LeafNode = Map::LeafNode;
 using InternalNode = Map::InternalNode;
+using TreeCheckResult = FieldIdToOffsetOpsOnInt64FieldMapCheckResult;
+
+std::string FieldIdText(const FieldId& key) {
+    StringOutputStream text;
+    {
+        xostream os(text);
+        os << key;
+    }
+    return text.str();
+}
 
 std::string Name(const prefbase& ref) {
     return "#" + std::to_string(ref.m_oid.value_);
@@ -208,10 +218,11 @@ private:
 
 }  // namespace
 
-TreeCheckResult CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map) {
+TreeCheckResult FieldIdToOffsetOpsOnInt64FieldMapCheck(
+    const FieldIdToOffsetOpsOnInt64FieldMap& map) {
     TreeCheckResult result;
     Checker(result).Run(map);
     return result;
 }
 
-}  // namespace tarn::tool
+}  // namespace tarn

@@ -1,6 +1,7 @@
 #pragma once
 
-// A structural check of a stored offsets map that reports, never aborts.
+// The one invariant checker of the map: a structural check that reports,
+// never aborts.
 //
 // The map's own Validate() stops the process on the first broken invariant,
 // and the map's code trusts every node it reaches to be of the kind its height
@@ -27,9 +28,9 @@
 
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
 
-namespace tarn::tool {
+namespace tarn {
 
-struct TreeCheckResult {
+struct FieldIdToOffsetOpsOnInt64FieldMapCheckResult {
     std::vector<std::string> problems;  // one line each; at most kMaxProblems
     int64 numProblems = 0;              // all problems found, also those not kept
     int64 leaves = 0;
@@ -42,6 +43,7 @@ struct TreeCheckResult {
     int64 Nodes() const { return leaves + internalNodes; }
 };
 
-TreeCheckResult CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map);
+FieldIdToOffsetOpsOnInt64FieldMapCheckResult FieldIdToOffsetOpsOnInt64FieldMapCheck(
+    const FieldIdToOffsetOpsOnInt64FieldMap& map);
 
-}  // namespace tarn::tool
+}  // namespace tarn
