@@ -1,15 +1,12 @@
 #pragma once
 
 // Helpers of the offsetops tests: scratch directories, running the program as
-// a child process, a model of what a store should hold, and reading a store
-// back in-process.
+// a child process, and a model of what a store should hold.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <map>
@@ -17,21 +14,19 @@
 #include <string>
 #include <vector>
 
-#include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/LmdbStore.h"
-#include "tnUtils/xostream.h"
-#include "tools/Recorder.h"
+#include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
+#include "tools/OpsFile.h"
 
 namespace tarn::testing {
 
 namespace fs = std::filesystem;
 
+// A new directory under the system's temporary one, removed with its contents.
 class ScratchDir {
 public:
     ScratchDir() {
         std::string pattern = (fs::temp_directory_path() / "tarn-tool-XXXXXX").string();
-        const char* made = ::mkdtemp(pattern.data());
-        EXPECT_NE(made, nullptr);
+        EXPECT_NE(::mkdtemp(pattern.data()), nullptr);
         m_path = pattern;
     }
     ~ScratchDir() {
@@ -52,53 +47,45 @@ private:
     fs::path m_path;
 };
 
-inline std::string ReadFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::ostringstream text;
-    text << in.rdbuf();
-    return text.str();
-}
-
 // What a run of the program gave: its exit status (128 + signal when killed)
 // and everything it wrote.
 struct ToolRun {
     int status = -1;
-    std::string out;
-    std::string err;
+    std::string out, err;
 };
 
-// Runs the program at `program` with `args`, standard input from `input`.
-inline ToolRun RunProgram(const std::string& program, const std::vector<std::string>& args,
-                          const std::string& input = {}) {
+inline std::string ReadFile(const std::string& path) {
+    std::ostringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
+// Runs offsetops with `args` (none holds a quote), its standard input
+// reading `input`.
+inline ToolRun Tool(const std::vector<std::string>& args, const std::string& input = {}) {
     ScratchDir io;
-    const std::string in = io.Write("in", input);
-    const std::string out = io.Sub("out");
-    const std::string err = io.Sub("err");
-    std::vector<std::string> all{program};
-    all.insert(all.end(), args.begin(), args.end());
-    std::vector<char*> argv;
-    for (std::string& a : all) {
-        argv.push_back(a.data());
+    std::string command = OFFSETOPS_PATH;
+    for (const std::string& a : args) {
+        command += " '" + a + "'";
     }
-    argv.push_back(nullptr);
-    const pid_t pid = ::fork();
-    if (pid == 0) {
-        const int fds[3] = {::open(in.c_str(), O_RDONLY),
-                            ::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644),
-                            ::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644)};
-        for (int i = 0; i < 3; ++i) {
-            ::dup2(fds[i], i);
-        }
-        ::execv(argv[0], argv.data());
-        ::_exit(127);
-    }
-    ToolRun run;
-    int status = 0;
-    EXPECT_EQ(::waitpid(pid, &status, 0), pid);
-    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    run.out = ReadFile(out);
-    run.err = ReadFile(err);
-    return run;
+    command += " <" + io.Write("in", input) + " >" + io.Sub("out") + " 2>" + io.Sub("err");
+    const int status = std::system(command.c_str());
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status),
+            ReadFile(io.Sub("out")), ReadFile(io.Sub("err"))};
+}
+
+// Runs offsetops expecting success, which says nothing on standard error
+// (nor does a sanitizer); what it printed on standard output.
+inline std::string RunOk(const std::vector<std::string>& args, const std::string& input = {}) {
+    ToolRun run = Tool(args, input);
+    EXPECT_TRUE(run.status == 0 && run.err.empty())
+        << ::testing::PrintToString(args) << ": status " << run.status << ", " << run.err;
+    return run.out;
+}
+
+// What `offsetops show` prints for the store in `dir`.
+inline std::string Shown(const std::string& dir) {
+    return RunOk({"show", "--store", dir});
 }
 
 // The tables a store should hold, in key order.
@@ -115,34 +102,14 @@ inline void Apply(Model& model, const tool::OffsetOperation& op) {
 inline std::string ShowText(const Model& model) {
     std::string text;
     for (const auto& [field, sites] : model) {
-        text += tool::FieldIdText(field) + " --> {";
-        bool first = true;
+        std::string table;
         for (const auto& [site, so] : sites) {
-            text += (first ? "(" : ",(") + ToString(site) + ",(" + std::to_string(so.t) + "," +
-                    std::to_string(so.o) + "))";
-            first = false;
+            table += (table.empty() ? "(" : ",(") + ToString(site) + ",(" + std::to_string(so.t) +
+                     "," + std::to_string(so.o) + "))";
         }
-        text += "}\n";
+        text += tool::FieldIdText(field) + " --> {" + table + "}\n";
     }
     return text;
-}
-
-// The tables of the store in `dir`, read in this process.
-inline Model ReadStore(const std::string& dir) {
-    Model model;
-    CSpace space(LmdbStore::Open(dir, OpenMode::ReadOnly));
-    CSpaceGuard guard(space, LockMode::Shared);
-    OID root = space.GetRoot(tool::kRecordRoot);
-    if (root.IsNull()) {
-        return model;
-    }
-    SpaceRef<OffsetOps> record(space, root);
-    const FieldIdToOffsetOpsOnInt64FieldMap& map = *record->m_map;
-    for (auto it = map.begin(); it != map.end(); ++it) {
-        model[it->first] = std::map<Guid, SiteOffset<int64>>(it->second.m_map.getmap().begin(),
-                                                             it->second.m_map.getmap().end());
-    }
-    return model;
 }
 
 }  // namespace tarn::testing
