@@ -450,6 +450,10 @@ int RunClear(const std::string& store, std::ostream& out, std::ostream& /*err*/)
     CSpace& space = *opened.space;
     CSpaceGuard guard(space, LockMode::Exclusive);
     SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
+    // Clearing hands the whole tree to deletion, which walks it: refuse a
+    // damaged tree before the map's code takes its nodes for what their
+    // level says they are.
+    RequireSoundTree(*record->m_map);
     const int64 fields = record->m_map->size();
     const ssize_t imagesBefore = space.GetStore().Stats().numImages;
     record->Clear();
