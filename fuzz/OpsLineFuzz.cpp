@@ -7,7 +7,7 @@
 // Properties:
 //   - parsing never crashes; every failure is an Error with a message;
 //   - an accepted operation prints (FormatOpsLine) to a line that parses
-//     back to the same operation; an accepted key prints (FieldIdText) to a
+//     back to the same operation; an accepted key prints (ToString) to a
 //     text that parses back to the same key;
 //   - the reader stops (End or Error) after at most one operation a line,
 //     and every error it reports has a message.
@@ -55,7 +55,7 @@ void CheckFieldId(std::string_view text) {
         return;
     }
     const std::optional<tarn::FieldId> again =
-        tarn::tool::ParseFieldId(tarn::tool::FieldIdText(*fid), &error);
+        tarn::tool::ParseFieldId(tarn::ToString(*fid), &error);
     if (!again || *again != *fid) {
         tarn::fuzz::PropertyFailed("a printed key does not parse back to itself");
     }

@@ -107,7 +107,7 @@ inline std::string ShowText(const Model& model) {
             table += (table.empty() ? "(" : ",(") + ToString(site) + ",(" + std::to_string(so.t) +
                      "," + std::to_string(so.o) + "))";
         }
-        text += tool::FieldIdText(field) + " --> {" + table + "}\n";
+        text += ToString(field) + " --> {" + table + "}\n";
     }
     return text;
 }

@@ -98,8 +98,8 @@ TEST(OpsFileParsing, ReadsFieldsAroundBlanksAndCommentsAndSaysWhatIsWrongWithALi
     EXPECT_EQ(tool::ParseOpsLine("   # only a comment").kind, ParsedLine::Kind::Nothing);
     EXPECT_EQ(tool::ParseOpsLine(" \t\r").kind, ParsedLine::Kind::Nothing);
     std::string error;
-    EXPECT_EQ(tool::FieldIdText(*tool::ParseFieldId("#12/0a0b", &error)), "#12/0a0b");
-    EXPECT_EQ(tool::FieldIdText(*tool::ParseFieldId("12", &error)), "#12/");
+    EXPECT_EQ(ToString(*tool::ParseFieldId("#12/0a0b", &error)), "#12/0a0b");
+    EXPECT_EQ(ToString(*tool::ParseFieldId("12", &error)), "#12/");
     EXPECT_FALSE(tool::ParseFieldId("#0/00", &error));
     EXPECT_FALSE(tool::ParseFieldId("#12/0", &error));
     EXPECT_THAT(error, HasSubstr("expected OID/PATH"));
@@ -163,7 +163,7 @@ TEST(ToolRoundTrip, RecordShowValidateStatsDumpAndClearInSeparateProcesses) {
     EXPECT_EQ(RowValue(rec, "height"), "1");
     EXPECT_EQ(Shown(store), ShowText(model));
     const auto& [someField, someSites] = *std::next(model.begin(), 17);
-    EXPECT_EQ(RunOk({"show", "--store", store, "--field", tool::FieldIdText(someField)}),
+    EXPECT_EQ(RunOk({"show", "--store", store, "--field", ToString(someField)}),
               ShowText({{someField, someSites}}));
     EXPECT_EQ(RunOk({"show", "--store", store, "--limit", "5"}),
               ShowText(Model(model.begin(), std::next(model.begin(), 5))) + "(5 of " + fields +

@@ -34,4 +34,13 @@ xostream& operator<<(xostream& os, const FieldId& f) {
     return os;
 }
 
+std::string ToString(const FieldId& f) {
+    StringOutputStream text;
+    {
+        xostream os(text);
+        os << f;
+    }
+    return text.str();
+}
+
 }  // namespace tarn

@@ -3,6 +3,8 @@
 // The key of the offset-operations map: a field (`path`) of one persistent
 // object (`oid`). Ordered by oid, then by path. Relocatable by byte copy.
 
+#include <string>
+
 #include "tnObject/Path.h"
 #include "tnPersistStore/OID.h"
 
@@ -54,5 +56,6 @@ InputArchive& operator>>(InputArchive& ar, FieldId& f);
 
 // Text form: the oid text, '/', then the path in lower-case hex ("#12/0a0b").
 xostream& operator<<(xostream& os, const FieldId& f);
+std::string ToString(const FieldId& f);
 
 }  // namespace tarn

@@ -2,6 +2,7 @@
 
 #include <cstdio>
 
+#include "tnUtils/Hex.h"
 #include "tnUtils/xostream.h"
 
 namespace tarn {
@@ -14,23 +15,6 @@ std::string ToString(const Guid& g) {
                   g.Data4[4], g.Data4[5], g.Data4[6], g.Data4[7]);
     return std::string(text, 36);
 }
-
-namespace {
-
-int HexValue(char c) {
-    if (c >= '0' && c <= '9') {
-        return c - '0';
-    }
-    if (c >= 'a' && c <= 'f') {
-        return c - 'a' + 10;
-    }
-    if (c >= 'A' && c <= 'F') {
-        return c - 'A' + 10;
-    }
-    return -1;
-}
-
-}  // namespace
 
 std::optional<Guid> ParseGuid(std::string_view text) {
     // The canonical form is 36 characters: dashes at 8, 13, 18 and 23 and a
@@ -49,7 +33,7 @@ std::optional<Guid> ParseGuid(std::string_view text) {
             }
             continue;
         }
-        int digit = HexValue(text[i]);
+        int digit = HexDigitValue(text[i]);
         if (digit < 0) {
             return std::nullopt;
         }

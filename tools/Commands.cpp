@@ -58,10 +58,6 @@ OID RecordRoot(CSpace& space, const std::string& dir) {
     return oid;
 }
 
-std::string Id(OID oid) {
-    return "#" + std::to_string(oid.value_);
-}
-
 void Row(std::ostream& out, const char* label, const std::string& value) {
     out << std::left << std::setw(16) << label << value << '\n';
 }
@@ -91,7 +87,7 @@ void LoadPathChecked(const Map& map, const FieldId& key) {
         const auto* node = static_cast<const Map::InternalNode*>(
             ref->Resolve(&GetReflectedClass<Map::InternalNode>()).m_self);
         if (node->m_numKeyEntrys < 1) {
-            throw RuntimeError("damaged tree: internal node " + Id(ref->m_oid) +
+            throw RuntimeError("damaged tree: internal node " + ToString(ref->m_oid) +
                                " holds no entries");
         }
         const ssize_t i = node->FindChildIndexGivenKey(key);
@@ -309,7 +305,7 @@ int RunShow(const std::string& store, const std::optional<FieldId>& field, int64
         LoadPathChecked(map, *field);
         const OffsetOpsOnField<int64>* table = map.rFind(*field);
         if (table == nullptr) {
-            return Fail(err, "no offsets recorded for field " + FieldIdText(*field));
+            return Fail(err, "no offsets recorded for field " + ToString(*field));
         }
         os << *field << " --> " << *table << '\n';
         return 0;
@@ -348,7 +344,7 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
     try {
         SpaceRef<OffsetOps> record(space, recordOid);
         const Map& map = *record->m_map;
-        Row(out, "record", Id(recordOid) + " (map " + Id(record->m_map.m_oid) + ")");
+        Row(out, "record", ToString(recordOid) + " (map " + ToString(record->m_map.m_oid) + ")");
         Row(out, "fields", std::to_string(map.size()));
         Row(out, "height", std::to_string(map.m_height));
         FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
@@ -418,7 +414,7 @@ int RunStats(const std::string& store, std::ostream& out, std::ostream& /*err*/)
     const StoreStats stats = space.GetStore().Stats();
     std::string roots;
     for (const auto& [name, oid] : space.Roots()) {
-        roots += (roots.empty() ? "" : " ") + name + "=" + Id(oid);
+        roots += (roots.empty() ? "" : " ") + name + "=" + ToString(oid);
     }
     SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
     const OID mapOid = record->m_map.m_oid;

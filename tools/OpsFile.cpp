@@ -3,6 +3,7 @@
 #include <charconv>
 #include <vector>
 
+#include "tnUtils/Hex.h"
 #include "tnUtils/xostream.h"
 
 namespace tarn::tool {
@@ -21,19 +22,6 @@ std::string_view Trim(std::string_view s) {
 
 std::string Quoted(std::string_view s) {
     return "'" + std::string(s) + "'";
-}
-
-int HexDigit(char c) {
-    if (c >= '0' && c <= '9') {
-        return c - '0';
-    }
-    if (c >= 'a' && c <= 'f') {
-        return c - 'a' + 10;
-    }
-    if (c >= 'A' && c <= 'F') {
-        return c - 'A' + 10;
-    }
-    return -1;
 }
 
 // A decimal integer filling all of `s`; std::errc{} on success,
@@ -104,8 +92,8 @@ bool ParsePath(std::string_view s, Path& path, std::string& error) {
     std::vector<octet_t> bytes;
     bytes.reserve(s.size() / 2);
     for (std::size_t i = 0; i < s.size(); i += 2) {
-        int hi = HexDigit(s[i]);
-        int lo = HexDigit(s[i + 1]);
+        int hi = HexDigitValue(s[i]);
+        int lo = HexDigitValue(s[i + 1]);
         if (hi < 0 || lo < 0) {
             error = "path " + Quoted(s) + " is not hex (two hex digits a byte)";
             return false;
@@ -134,15 +122,6 @@ bool ParseOffset(std::string_view s, int64& offset, std::string& error) {
 }
 
 }  // namespace
-
-std::string FieldIdText(const FieldId& fid) {
-    StringOutputStream text;
-    {
-        xostream os(text);
-        os << fid;
-    }
-    return text.str();
-}
 
 std::string FormatOpsLine(const OffsetOperation& op) {
     StringOutputStream path;

@@ -61,9 +61,6 @@ ParsedLine ParseOpsLine(std::string_view line);
 // path. Nothing, with a message in `error`, when the text is not one.
 std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error);
 
-// The text form of a key, as FieldId prints it ("#12/0a0b").
-std::string FieldIdText(const FieldId& fid);
-
 // Reads operations from a stream line by line, skipping blanks and comments.
 // Not thread-safe; owns nothing but its line buffer.
 class OpsFileReader {

@@ -73,13 +73,13 @@ std::string Recorder::Check(const OffsetOperation& op) {
     if (op.t < so.t) {
         return "time stamp " + std::to_string(op.t) + " of site " + ToString(op.site) +
                " is older than " + std::to_string(so.t) + ", the one recorded for field " +
-               FieldIdText(op.field);
+               ToString(op.field);
     }
     int64 sum;
     if (__builtin_add_overflow(so.o, op.offset, &sum)) {
         return "offset " + std::to_string(op.offset) + " would overflow the sum " +
                std::to_string(so.o) + " of site " + ToString(op.site) + " for field " +
-               FieldIdText(op.field);
+               ToString(op.field);
     }
     return {};
 }

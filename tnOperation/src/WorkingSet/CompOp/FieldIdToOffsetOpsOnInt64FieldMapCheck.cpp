@@ -15,17 +15,8 @@ using LeafNode = Map::LeafNode;
 using InternalNode = Map::InternalNode;
 using TreeCheckResult = FieldIdToOffsetOpsOnInt64FieldMapCheckResult;
 
-std::string FieldIdText(const FieldId& key) {
-    StringOutputStream text;
-    {
-        xostream os(text);
-        os << key;
-    }
-    return text.str();
-}
-
 std::string Name(const prefbase& ref) {
-    return "#" + std::to_string(ref.m_oid.value_);
+    return ToString(ref.m_oid);
 }
 
 class Checker {
@@ -158,13 +149,13 @@ private:
                   const FieldId* above) {
         const bool firstInNode = below != nullptr && i == 0;
         if (below != nullptr && CompareKeys(*below, key) > (firstInNode ? 0 : -1)) {
-            Problem(name + ": key " + std::to_string(i) + " " + FieldIdText(key) +
+            Problem(name + ": key " + std::to_string(i) + " " + ToString(key) +
                     (firstInNode ? " is below the separator " : " does not follow ") +
-                    FieldIdText(*below));
+                    ToString(*below));
         }
         if (above != nullptr && CompareKeys(key, *above) >= 0) {
-            Problem(name + ": key " + std::to_string(i) + " " + FieldIdText(key) +
-                    " is not below the separator " + FieldIdText(*above));
+            Problem(name + ": key " + std::to_string(i) + " " + ToString(key) +
+                    " is not below the separator " + ToString(*above));
         }
     }
 
@@ -199,7 +190,7 @@ private:
                 if (before->m_numKeyEntrys > 0 && leaf->m_numKeyEntrys > 0 &&
                     CompareKeys(before->GetEntry(before->m_numKeyEntrys - 1).first,
                                 leaf->GetEntry(0).first) >= 0) {
-                    Problem(name + " starts at " + FieldIdText(leaf->GetEntry(0).first) +
+                    Problem(name + " starts at " + ToString(leaf->GetEntry(0).first) +
                             ", not above the previous leaf's last key");
                 }
             }
