@@ -13,7 +13,7 @@
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/MemoryStore.h"
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnUtils/MemoryOutputStream.h"
 

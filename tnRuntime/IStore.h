@@ -17,7 +17,7 @@
 #include <string_view>
 #include <vector>
 
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tnUtils/Types.h"
 
 namespace tarn {

@@ -9,7 +9,7 @@
 
 #include <xxhash.h>
 
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tnUtils/Assert.h"
 
 namespace tarn {

@@ -5,7 +5,7 @@
 #include <CLI/CLI.hpp>
 #include <new>
 
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tools/Commands.h"
 
 namespace tarn::tool {

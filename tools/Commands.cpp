@@ -12,7 +12,7 @@
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/LmdbStore.h"
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tnUtils/xostream.h"
 #include "tools/CountingStore.h"
 #include "tools/OstreamOutputStream.h"

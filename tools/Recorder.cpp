@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 
 namespace tarn::tool {
 

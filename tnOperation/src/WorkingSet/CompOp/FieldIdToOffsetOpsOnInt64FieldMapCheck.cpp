@@ -3,7 +3,7 @@
 #include <unordered_set>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 #include "tnUtils/xostream.h"
 
 namespace tarn {

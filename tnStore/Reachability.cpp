@@ -1,13 +1,13 @@
-#include "tools/Reachability.h"
+#include "tnStore/Reachability.h"
 
 #include <deque>
 #include <unordered_set>
 
 #include "tnPersistStore/IPrefVisitor.h"
 #include "tnPersistStore/pref.h"
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 namespace {
 
@@ -61,4 +61,4 @@ ReachabilityResult FindUnreachableImages(CSpace& space) {
     return result;
 }
 
-}  // namespace tarn::tool
+}  // namespace tarn

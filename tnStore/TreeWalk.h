@@ -19,7 +19,7 @@
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
 #include "tnRuntime/CSpace.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 struct TreeShape {
     ssize_t height = -1;
@@ -39,4 +39,4 @@ TreeShape WalkTree(CSpace& space, OID mapOid, ssize_t bound, const LeafVisitor& 
 // resident. Needs the space exclusively.
 void KeepResidentsUnder(CSpace& space, ssize_t bound);
 
-}  // namespace tarn::tool
+}  // namespace tarn

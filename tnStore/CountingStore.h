@@ -9,7 +9,7 @@
 
 #include "tnRuntime/IStore.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 class CountingStore final : public IStore {
 public:
@@ -45,4 +45,4 @@ private:
     int64 m_commits = 0;
 };
 
-}  // namespace tarn::tool
+}  // namespace tarn

@@ -14,7 +14,7 @@
 
 #include "tnRuntime/CSpace.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 struct ReachabilityResult {
     int64 stored = 0;                 // images in the store
@@ -25,4 +25,4 @@ struct ReachabilityResult {
 
 ReachabilityResult FindUnreachableImages(CSpace& space);
 
-}  // namespace tarn::tool
+}  // namespace tarn

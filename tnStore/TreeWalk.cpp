@@ -1,11 +1,11 @@
-#include "tools/TreeWalk.h"
+#include "tnStore/TreeWalk.h"
 
 #include <string>
 #include <vector>
 
-#include "tnRuntime/RuntimeError.h"
+#include "tnUtils/RuntimeError.h"
 
-namespace tarn::tool {
+namespace tarn {
 
 namespace {
 
@@ -68,4 +68,4 @@ TreeShape WalkTree(CSpace& space, OID mapOid, ssize_t bound, const LeafVisitor& 
     return shape;
 }
 
-}  // namespace tarn::tool
+}  // namespace tarn

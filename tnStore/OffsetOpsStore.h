@@ -1,0 +1,225 @@
+#pragma once
+
+// The front door of the offset operations record: open a store, record
+// offset operations into it, make them durable, read the per-field tables
+// back, close.
+//
+//   OffsetOpsStore store = OffsetOpsStore::Open("store");   // a directory
+//   store.Record(Opid(site, 7), FieldId(OID(Seid(uint64{42})), Path("\x01", 1)), 12);
+//   store.Sync();                                            // durable from here on
+//   std::optional<OffsetOpsOnField<int64>> table = store.Find(field);
+//   store.Close();
+//
+// Handles. An OffsetOpsStore owns everything it opened (the object space, the
+// on-disk environment, the journal); it is movable, not copyable, and closes
+// itself when destroyed. Tables handed out (Find, the ForEach callbacks) are
+// copies or references valid for the duration of the call only.
+//
+// Concurrency. One handle is used by one thread at a time; it is not
+// thread-safe. Across handles and processes: one writer per store directory
+// (a second writer is refused at once with "in use"), and any number of
+// readers beside it. A reader sees, from the moment it opens, one consistent
+// checkpoint plus every durable point the writer had reached by then; it
+// never waits for the writer nor blocks it. Opening the same directory as
+// writer and reader in one process is not supported (LMDB's locks are per
+// process).
+//
+// Durability. Record changes memory only. Sync() makes every operation
+// recorded so far durable: it appends them to the journal (one checksummed
+// record) and syncs the file. A crash at any moment leaves exactly the
+// operations up to the last completed Sync(); opening replays the journal's
+// operations after the last checkpoint. A checkpoint writes the changed tree
+// nodes in one LMDB transaction together with the journal position they
+// cover. Checkpoints run at a durable point, never between two:
+//   - when the journal has grown past StoreOptions::journalLimitBytes;
+//   - when StoreOptions::cacheObjects is set and changed nodes hold more
+//     objects in memory than it allows (between durable points the bound is
+//     kept by releasing clean nodes only; the changed nodes of operations that
+//     are not durable yet stay in memory until the next Sync);
+//   - on Checkpoint() and on Close().
+// After a checkpoint the journal starts again, empty. A larger journal limit
+// means fewer tree writes per operation and a longer replay when opening
+// after a crash (about a million operations a second).
+//
+// Failures. Every failure is an exception derived from RuntimeError
+// (tnUtils/RuntimeError.h) whose what() is one line naming the file and what
+// is wrong: a missing, unreadable or damaged store, journal or lock file, a
+// full disk ("no space left on device"), a second writer. Record refuses an
+// operation that the record must not be given by throwing RecordRefused,
+// which names the field and the site and changes nothing. After any other
+// error while writing, the handle is broken: further writes throw, nothing
+// more becomes durable, and the store on disk keeps its last durable point.
+
+#include <cstddef>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <ostream>
+#include <string>
+#include <vector>
+
+#include "tnOperation/FieldId.h"
+#include "tnOperation/src/Util/Opid.h"
+#include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
+#include "tnUtils/RuntimeError.h"
+
+namespace tarn {
+
+// Time stamps are stored as variable-length integers that carry 32 bits.
+inline constexpr int64 kMaxTimeStamp = 4294967295;
+
+enum class StoreMode {
+    Write,          // one writer; creates the directory and the store if missing
+    WriteExisting,  // one writer; the store must exist
+    Read,           // a reader beside any writer; never writes
+};
+
+struct StoreOptions {
+    StoreMode mode = StoreMode::Write;
+    // Sync the journal at each durable point and each checkpoint. Off: a
+    // crash of the process loses nothing that Sync() returned from, a crash
+    // of the machine may lose the latest durable points. For scratch stores.
+    bool sync = true;
+    // A durable point checkpoints when the journal has grown past this.
+    std::size_t journalLimitBytes = std::size_t{64} << 20;
+    // At most this many tree objects in memory at durable points (0: no
+    // bound). Must leave room for one operation: see MinCacheObjects().
+    ssize_t cacheObjects = 0;
+};
+
+// An operation Record refused, with nothing changed.
+class RecordRefused : public RuntimeError {
+public:
+    enum class Reason { TimeStampOutOfRange, TimeStampOlder, SumOverflow };
+
+    RecordRefused(Reason reason, const FieldId& field, const Guid& site, std::string message)
+        : RuntimeError(std::move(message)), m_reason(reason), m_field(field), m_site(site) {}
+
+    Reason GetReason() const { return m_reason; }
+    const FieldId& Field() const { return m_field; }
+    const Guid& Site() const { return m_site; }
+
+private:
+    Reason m_reason;
+    FieldId m_field;
+    Guid m_site;
+};
+
+struct StoreStatistics {
+    int64 fields = 0;
+    ssize_t height = -1;  // of the tree; -1 when empty
+    int64 leaves = 0;
+    int64 internalNodes = 0;
+    int64 images = 0;       // stored images (on-disk: as of the last checkpoint)
+    int64 imageBytes = 0;   // their bytes, framing included
+    int64 journalBytes = 0; // the journal file
+    uint64 durableOperations = 0;  // journaled operations since the store was made
+    uint64 checkpointedOperations = 0;
+    int64 pendingOperations = 0;   // recorded, not yet durable
+    int64 checkpoints = 0;         // by this handle
+    int64 imagesWritten = 0;       // by this handle's checkpoints
+    int64 imageBytesWritten = 0;   // their image bytes
+    ssize_t residents = 0;         // tree objects in memory now
+    ssize_t peakResidents = 0;     // the most at once, measured after each operation
+    int64 replayedOperations = 0;  // replayed from the journal when opening
+
+    int64 Nodes() const { return leaves + internalNodes; }
+};
+
+// The non-aborting check of the tree: every node of the kind its level needs,
+// entries in order and within bounds, counts within limits, the leaf chain,
+// the size. Loads the whole tree (within the cache bound).
+struct StoreCheck {
+    std::vector<std::string> problems;  // one line each, the first 50
+    int64 numProblems = 0;
+    bool Ok() const { return numProblems == 0; }
+};
+
+// The check above, the map's own validation and the stored images no root
+// reaches.
+struct StoreValidation {
+    StoreCheck check;
+    bool mapValid = false;         // the map's own Validate, run only on a sound tree
+    int64 images = 0;              // stored
+    int64 reached = 0;             // of those, reached from a root
+    std::vector<uint64> unreachable;
+    OID record;                    // the record's identity
+    OID map;                       // the map's identity
+    bool Ok() const { return check.Ok() && mapValid && unreachable.empty(); }
+};
+
+class OffsetOpsStore {
+public:
+    // Opens the store in directory `dir` (see StoreOptions::mode).
+    static OffsetOpsStore Open(const std::string& dir, const StoreOptions& options = {});
+    // A store that lives in memory only, for tests and scratch work: Sync and
+    // Checkpoint cost nothing and nothing outlives the handle.
+    static OffsetOpsStore OpenInMemory(const StoreOptions& options = {});
+
+    OffsetOpsStore(OffsetOpsStore&&) noexcept;
+    OffsetOpsStore& operator=(OffsetOpsStore&&) noexcept;
+    // Closes the store: Close(), errors swallowed.
+    ~OffsetOpsStore();
+
+    // --- Writing (writers only) -----------------------------------------------
+
+    // Adds `offset` to the table of `field` under the site and time stamp of
+    // `opid`. Throws RecordRefused (and changes nothing) for a time stamp
+    // outside 0..kMaxTimeStamp, one older than the site's recorded one for
+    // the field, or a sum that would overflow.
+    void Record(const Opid& opid, const FieldId& field, int64 offset);
+    // Removes every field's table.
+    void Clear();
+    // A durable point: every operation recorded so far is in the journal and
+    // synced when this returns. May checkpoint (see above).
+    void Sync();
+    // A durable point, then a checkpoint.
+    void Checkpoint();
+
+    // --- Reading (any handle) ---------------------------------------------------
+
+    // A copy of the table of `field`, or nothing.
+    std::optional<OffsetOpsOnField<int64>> Find(const FieldId& field);
+    // Calls `fn` for every field from the first not less than `from`, in key
+    // order, until it returns false.
+    using FieldVisitor = std::function<bool(const FieldId&, const OffsetOpsOnField<int64>&)>;
+    void ForEachFrom(const FieldId& from, const FieldVisitor& fn);
+    void ForEach(const FieldVisitor& fn) { ForEachFrom(FieldId(), fn); }
+    // Every field of the object `oid`, in path order.
+    void ForEachOfObject(OID oid, const FieldVisitor& fn);
+    // The number of fields that hold a table.
+    int64 Size();
+    bool Empty() { return Size() == 0; }
+
+    StoreStatistics Stats();
+    StoreCheck Check();
+    StoreValidation Validate();
+    // The tree, node by node (after the check; throws RuntimeError on a
+    // damaged tree).
+    void Dump(std::ostream& out);
+
+    // --- Lifetime ---------------------------------------------------------------
+
+    // Writers: a durable point and a checkpoint, then releases everything.
+    // Readers: releases everything. Further calls other than the destructor
+    // throw. Idempotent.
+    void Close();
+
+    bool IsReader() const;
+    const std::string& Directory() const;  // "" for an in-memory store
+    // What opening repaired (a torn journal tail dropped, a lock file made
+    // anew), one line each.
+    const std::vector<std::string>& Repairs() const;
+
+    // The fewest objects StoreOptions::cacheObjects may allow for a tree of
+    // `height`.
+    static ssize_t MinCacheObjects(ssize_t height);
+
+    struct Impl;
+
+private:
+    explicit OffsetOpsStore(std::unique_ptr<Impl> impl);
+    std::unique_ptr<Impl> m_impl;
+};
+
+}  // namespace tarn
