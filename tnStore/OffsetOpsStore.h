@@ -110,9 +110,9 @@ struct StoreStatistics {
     ssize_t height = -1;  // of the tree; -1 when empty
     int64 leaves = 0;
     int64 internalNodes = 0;
-    int64 images = 0;       // stored images (on-disk: as of the last checkpoint)
-    int64 imageBytes = 0;   // their bytes, framing included
-    int64 journalBytes = 0; // the journal file
+    int64 images = 0;              // stored images (on-disk: as of the last checkpoint)
+    int64 imageBytes = 0;          // their bytes, framing included
+    int64 journalBytes = 0;        // the journal file
     uint64 durableOperations = 0;  // journaled operations since the store was made
     uint64 checkpointedOperations = 0;
     int64 pendingOperations = 0;   // recorded, not yet durable
@@ -139,12 +139,12 @@ struct StoreCheck {
 // reaches.
 struct StoreValidation {
     StoreCheck check;
-    bool mapValid = false;         // the map's own Validate, run only on a sound tree
-    int64 images = 0;              // stored
-    int64 reached = 0;             // of those, reached from a root
+    bool mapValid = false;  // the map's own Validate, run only on a sound tree
+    int64 images = 0;       // stored
+    int64 reached = 0;      // of those, reached from a root
     std::vector<uint64> unreachable;
-    OID record;                    // the record's identity
-    OID map;                       // the map's identity
+    OID record;  // the record's identity
+    OID map;     // the map's identity
     bool Ok() const { return check.Ok() && mapValid && unreachable.empty(); }
 };
 

@@ -1,0 +1,598 @@
+#include "tnStore/Journal.h"
+
+// The checksums come from libxxhash, found together with LMDB.
+#ifdef TARN_HAVE_LMDB
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <xxhash.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <limits>
+#include <utility>
+
+#include "tnUtils/Assert.h"
+#include "tnUtils/RuntimeError.h"
+
+namespace tarn {
+
+namespace {
+
+constexpr octet_t kFileMagic[8] = {'T', 'A', 'R', 'N', 'J', 'R', 'N', 'L'};
+constexpr octet_t kRecordMagic[4] = {'T', 'J', 'R', '1'};
+constexpr uint32 kVersion = 1;
+constexpr uint64 kMaxTimeStamp = 4294967295;
+constexpr uint8 kKindRecord = 1;
+constexpr uint8 kKindClear = 2;
+constexpr std::size_t kGuidBytes = 16;
+constexpr std::size_t kMaxVarintBytes = 10;
+// Scans read the file this much at a time (more when one record is larger).
+constexpr std::size_t kReadChunk = std::size_t{4} << 20;
+
+void PutLe(octet_t* out, uint64 value, std::size_t width) {
+    for (std::size_t i = 0; i < width; ++i) {
+        out[i] = static_cast<octet_t>(value >> (8 * i));
+    }
+}
+
+uint64 GetLe(const octet_t* in, std::size_t width) {
+    uint64 value = 0;
+    for (std::size_t i = 0; i < width; ++i) {
+        value |= static_cast<uint64>(in[i]) << (8 * i);
+    }
+    return value;
+}
+
+octet_t* PutVarint(octet_t* out, uint64 value) {
+    while (value >= 0x80) {
+        *out++ = static_cast<octet_t>(value | 0x80);
+        value >>= 7;
+    }
+    *out++ = static_cast<octet_t>(value);
+    return out;
+}
+
+// False when the varint runs past `end`, is longer than ten bytes or does
+// not fit 64 bits.
+inline bool GetVarint(const octet_t*& p, const octet_t* end, uint64& value) {
+    uint64 result = 0;
+    for (unsigned shift = 0; shift < 7 * kMaxVarintBytes; shift += 7) {
+        if (p == end) {
+            return false;
+        }
+        const octet_t byte = *p++;
+        if (shift == 63 && byte > 1) {
+            return false;
+        }
+        result |= static_cast<uint64>(byte & 0x7f) << shift;
+        if (byte < 0x80) {
+            value = result;
+            return true;
+        }
+    }
+    return false;
+}
+
+std::string JoinPath(const std::string& dir, const char* name) {
+    if (dir.empty()) {
+        return name;
+    }
+    return dir.back() == '/' ? dir + name : dir + "/" + name;
+}
+
+std::string ErrorText(int error) {
+    if (error == ENOSPC || error == EDQUOT) {
+        return "no space left on device";
+    }
+    return std::strerror(error);
+}
+
+[[noreturn]] void IoError(const std::string& path, const char* action, int error) {
+    throw RuntimeError("journal '" + path + "': cannot " + action + ": " + ErrorText(error));
+}
+
+[[noreturn]] void Damage(const std::string& path, uint64 offset, const std::string& what) {
+    throw RuntimeError("journal '" + path + "' is damaged at byte " + std::to_string(offset) +
+                       ": " + what);
+}
+
+void EncodeFileHeader(uint64 base, octet_t* out) {
+    std::memcpy(out, kFileMagic, sizeof kFileMagic);
+    PutLe(out + 8, kVersion, 4);
+    PutLe(out + 12, 0, 4);
+    PutLe(out + 16, base, 8);
+    PutLe(out + 24, XXH3_64bits(out, 24), 8);
+}
+
+uint32 RecordHeaderChecksum(const octet_t* header) {
+    return static_cast<uint32>(XXH3_64bits(header, 20));
+}
+
+// Closes the descriptor it holds when it goes out of scope.
+class Fd {
+public:
+    explicit Fd(int fd) : m_fd(fd) {}
+    ~Fd() {
+        if (m_fd >= 0) {
+            ::close(m_fd);
+        }
+    }
+    Fd(const Fd&) = delete;
+    Fd& operator=(const Fd&) = delete;
+    int Get() const { return m_fd; }
+    int Release() { return std::exchange(m_fd, -1); }
+
+private:
+    int m_fd;
+};
+
+void WriteAll(int fd, const octet_t* bytes, std::size_t size, uint64 at, const std::string& path) {
+    std::size_t done = 0;
+    while (done < size) {
+        const ssize_t n = ::pwrite(fd, bytes + done, size - done, static_cast<off_t>(at + done));
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            IoError(path, "write", n < 0 ? errno : EIO);
+        }
+        done += static_cast<std::size_t>(n);
+    }
+}
+
+// Reads a file front to back, up to the size it had when opened, keeping the
+// bytes asked for in one buffer.
+class FileReader {
+public:
+    FileReader(int fd, const std::string& path, uint64 size)
+        : m_fd(fd), m_path(path), m_size(size) {}
+
+    uint64 Size() const { return m_size; }
+
+    // The bytes [pos, pos + n), n <= Size() - pos, where pos never goes below
+    // an earlier call's. Null when the file turned out shorter (a writer
+    // cut it meanwhile); Size() is then what was there.
+    const octet_t* Get(uint64 pos, std::size_t n) {
+        TARN_ASSERT(pos >= m_bufPos && n <= m_size - pos);
+        if (pos + n <= m_bufPos + m_bufLen) {
+            return m_buf.data() + (pos - m_bufPos);
+        }
+        const uint64 bufEnd = m_bufPos + m_bufLen;
+        const std::size_t kept = pos < bufEnd ? static_cast<std::size_t>(bufEnd - pos) : 0;
+        if (kept > 0) {
+            std::memmove(m_buf.data(), m_buf.data() + (pos - m_bufPos), kept);
+        }
+        m_bufPos = pos;
+        m_bufLen = kept;
+        const std::size_t capacity = std::max<uint64>(n, std::min<uint64>(kReadChunk, m_size));
+        if (m_buf.size() < capacity) {
+            m_buf.resize(capacity);
+        }
+        while (m_bufLen < n) {
+            const uint64 at = m_bufPos + m_bufLen;
+            const std::size_t want = std::min<uint64>(m_buf.size() - m_bufLen, m_size - at);
+            const ssize_t got =
+                ::pread(m_fd, m_buf.data() + m_bufLen, want, static_cast<off_t>(at));
+            if (got < 0 && errno == EINTR) {
+                continue;
+            }
+            if (got < 0) {
+                IoError(m_path, "read", errno);
+            }
+            if (got == 0) {
+                m_size = at;
+                return nullptr;
+            }
+            m_bufLen += static_cast<std::size_t>(got);
+        }
+        return m_buf.data();
+    }
+
+private:
+    int m_fd;
+    const std::string& m_path;
+    uint64 m_size;
+    std::vector<octet_t> m_buf;
+    uint64 m_bufPos = 0;
+    std::size_t m_bufLen = 0;
+};
+
+// Decodes the entries of one record payload, checking every bound.
+class PayloadDecoder {
+public:
+    PayloadDecoder(const std::string& path, uint64 offset, const octet_t* payload, std::size_t size)
+        : m_path(path), m_offset(offset), m_begin(payload), m_end(payload + size), m_p(payload) {}
+
+    void Restart() {
+        m_p = m_begin;
+        m_sites.clear();
+    }
+    bool AtEnd() const { return m_p == m_end; }
+    std::size_t Left() const { return static_cast<std::size_t>(m_end - m_p); }
+    uint64 Offset() const { return m_offset + static_cast<uint64>(m_p - m_begin); }
+
+    // Decodes the next entry, into `entry` when kFill.
+    template <bool kFill>
+    void Next(JournalEntry& entry) {
+        if (m_p == m_end) {
+            Fail("entry runs past the end of the record");
+        }
+        const octet_t kind = *m_p++;
+        if (kind == kKindClear) {
+            if constexpr (kFill) {
+                entry.kind = JournalEntry::Kind::Clear;
+                entry.site = Guid{};
+                entry.t = 0;
+                entry.field.oid = OID();
+                entry.field.path.clear();
+                entry.offset = 0;
+            }
+            return;
+        }
+        if (kind != kKindRecord) {
+            --m_p;
+            Fail("unknown entry kind " + std::to_string(kind));
+        }
+        const uint64 site = Varint("site index");
+        if (site > m_sites.size()) {
+            Fail("site index " + std::to_string(site) + " beyond the record's " +
+                 std::to_string(m_sites.size()) + " sites");
+        }
+        if (site == m_sites.size()) {
+            if (Left() < kGuidBytes) {
+                Fail("site runs past the end of the record");
+            }
+            Guid g;
+            g.Data1 = static_cast<uint32>(GetLe(m_p, 4));
+            g.Data2 = static_cast<uint16>(GetLe(m_p + 4, 2));
+            g.Data3 = static_cast<uint16>(GetLe(m_p + 6, 2));
+            std::memcpy(g.Data4, m_p + 8, sizeof g.Data4);
+            m_p += kGuidBytes;
+            m_sites.push_back(g);
+        }
+        const uint64 t = Varint("time stamp");
+        if (t > kMaxTimeStamp) {
+            Fail("time stamp " + std::to_string(t) + " out of range");
+        }
+        const uint64 oid = Varint("oid");
+        const uint64 pathLength = Varint("path length");
+        if (pathLength > Journal::kMaxPathBytes || pathLength > Left()) {
+            Fail("path of " + std::to_string(pathLength) +
+                 " bytes runs past the end of the record");
+        }
+        const octet_t* pathBytes = m_p;
+        m_p += pathLength;
+        const uint64 zigzag = Varint("offset");
+        if constexpr (kFill) {
+            entry.kind = JournalEntry::Kind::Record;
+            entry.site = m_sites[site];
+            entry.t = static_cast<int64>(t);
+            entry.field.oid = OID(Seid(oid));
+            entry.field.path.clear();
+            entry.field.path.Append(pathBytes, static_cast<ssize_t>(pathLength));
+            entry.offset = static_cast<int64>((zigzag >> 1) ^ (~(zigzag & 1) + 1));
+        }
+    }
+
+    [[noreturn]] void Fail(const std::string& what) const { Damage(m_path, Offset(), what); }
+
+private:
+    uint64 Varint(const char* what) {
+        uint64 value = 0;
+        const octet_t* start = m_p;
+        if (!GetVarint(m_p, m_end, value)) {
+            m_p = start;
+            Fail(std::string("damaged ") + what + " varint");
+        }
+        return value;
+    }
+
+    const std::string& m_path;
+    uint64 m_offset;
+    const octet_t* m_begin;
+    const octet_t* m_end;
+    const octet_t* m_p;
+    std::vector<Guid> m_sites;
+};
+
+bool AllZeros(FileReader& reader, uint64 pos, uint64 end) {
+    while (pos < end) {
+        const std::size_t n = std::min<uint64>(end - pos, kReadChunk);
+        const octet_t* bytes = reader.Get(pos, n);
+        if (bytes == nullptr) {
+            return true;  // cut meanwhile: what was there held zeros only
+        }
+        for (std::size_t i = 0; i < n; ++i) {
+            if (bytes[i] != 0) {
+                return false;
+            }
+        }
+        pos += n;
+    }
+    return true;
+}
+
+}  // namespace
+
+JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& apply) {
+    Fd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (fd.Get() < 0) {
+        if (errno == ENOENT) {
+            throw RuntimeError("journal '" + path + "' does not exist");
+        }
+        IoError(path, "open", errno);
+    }
+    struct stat st;
+    if (::fstat(fd.Get(), &st) != 0) {
+        IoError(path, "stat", errno);
+    }
+    FileReader reader(fd.Get(), path, static_cast<uint64>(st.st_size));
+    if (reader.Size() < kHeaderBytes) {
+        Damage(path, 0,
+               "the file is " + std::to_string(reader.Size()) + " bytes, shorter than its header");
+    }
+    const octet_t* header = reader.Get(0, kHeaderBytes);
+    if (header == nullptr) {
+        Damage(path, 0, "the file was cut while being read");
+    }
+    if (std::memcmp(header, kFileMagic, sizeof kFileMagic) != 0) {
+        Damage(path, 0, "not a journal (bad magic)");
+    }
+    const uint64 version = GetLe(header + 8, 4);
+    if (version != kVersion) {
+        Damage(path, 8, "unknown version " + std::to_string(version));
+    }
+    if (GetLe(header + 24, 8) != XXH3_64bits(header, 24)) {
+        Damage(path, 24, "header checksum mismatch");
+    }
+
+    JournalScan scan;
+    scan.base = GetLe(header + 16, 8);
+    scan.end = scan.base;
+    uint64 pos = kHeaderBytes;
+    JournalEntry entry;
+    while (pos < reader.Size()) {
+        const uint64 left = reader.Size() - pos;
+        if (left < kRecordHeaderBytes) {
+            break;  // torn: shorter than a record header
+        }
+        const octet_t* h = reader.Get(pos, kRecordHeaderBytes);
+        if (h == nullptr) {
+            continue;  // cut meanwhile: look again at what is left
+        }
+        if (GetLe(h + 20, 4) != RecordHeaderChecksum(h)) {
+            if (AllZeros(reader, pos + kRecordHeaderBytes, reader.Size())) {
+                break;  // torn: a header that never made it, zeros after it
+            }
+            Damage(path, pos, "record header checksum mismatch");
+        }
+        if (std::memcmp(h, kRecordMagic, sizeof kRecordMagic) != 0) {
+            Damage(path, pos, "bad record magic");
+        }
+        const uint64 length = GetLe(h + 4, 4);
+        const uint64 first = GetLe(h + 8, 8);
+        const uint64 count = GetLe(h + 16, 4);
+        const uint64 checksum = GetLe(h + 24, 8);
+        if (length > kMaxPayload) {
+            Damage(path, pos,
+                   "record payload of " + std::to_string(length) + " bytes over the limit");
+        }
+        if (count == 0) {
+            Damage(path, pos, "record holds no entries");
+        }
+        if (first != scan.end) {
+            Damage(path, pos,
+                   "record starts at entry " + std::to_string(first) + ", expected " +
+                       std::to_string(scan.end));
+        }
+        if (count > std::numeric_limits<uint64>::max() - first) {
+            Damage(path, pos, "record's entry numbers overflow");
+        }
+        if (length > left - kRecordHeaderBytes) {
+            break;  // torn: the payload runs past the end of the file
+        }
+        const octet_t* record = reader.Get(pos, kRecordHeaderBytes + length);
+        if (record == nullptr) {
+            continue;
+        }
+        const octet_t* payload = record + kRecordHeaderBytes;
+        if (XXH3_64bits_withSeed(payload, length, first) != checksum) {
+            if (length == left - kRecordHeaderBytes) {
+                break;  // torn: the last record, its payload not all written
+            }
+            Damage(path, pos + kRecordHeaderBytes, "record payload checksum mismatch");
+        }
+
+        // Check the whole record, then apply the entries asked for.
+        PayloadDecoder decoder(path, pos + kRecordHeaderBytes, payload, length);
+        for (uint64 i = 0; i < count; ++i) {
+            decoder.Next<false>(entry);
+        }
+        if (!decoder.AtEnd()) {
+            decoder.Fail(std::to_string(decoder.Left()) + " bytes after the record's " +
+                         std::to_string(count) + " entries");
+        }
+        if (from < first + count) {
+            decoder.Restart();
+            for (uint64 i = 0; i < count; ++i) {
+                if (first + i < from) {
+                    decoder.Next<false>(entry);
+                } else {
+                    decoder.Next<true>(entry);
+                    apply(first + i, entry);
+                }
+            }
+        }
+        pos += kRecordHeaderBytes + length;
+        scan.end = first + count;
+    }
+    scan.validBytes = pos;
+    scan.fileBytes = reader.Size();
+    return scan;
+}
+
+void Journal::Reset(const std::string& dir, uint64 base, bool sync) {
+    const std::string target = JoinPath(dir, kFileName);
+    const std::string temp = target + ".new";
+    octet_t header[kHeaderBytes];
+    EncodeFileHeader(base, header);
+    try {
+        Fd fd(::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
+        if (fd.Get() < 0) {
+            IoError(temp, "create", errno);
+        }
+        WriteAll(fd.Get(), header, sizeof header, 0, temp);
+        if (sync && ::fsync(fd.Get()) != 0) {
+            IoError(temp, "sync", errno);
+        }
+        if (::close(fd.Release()) != 0) {
+            IoError(temp, "close", errno);
+        }
+        if (::rename(temp.c_str(), target.c_str()) != 0) {
+            IoError(temp, ("rename to '" + target + "'").c_str(), errno);
+        }
+    } catch (...) {
+        ::unlink(temp.c_str());
+        throw;
+    }
+    if (sync) {
+        const std::string where = dir.empty() ? "." : dir;
+        Fd dirFd(::open(where.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        if (dirFd.Get() < 0 || ::fsync(dirFd.Get()) != 0) {
+            const int error = errno;
+            throw RuntimeError("journal '" + target + "': cannot sync directory '" + where +
+                               "': " + ErrorText(error));
+        }
+    }
+}
+
+Journal::Journal(const std::string& dir, const JournalScan& scan, bool sync)
+    : m_path(JoinPath(dir, kFileName)),
+      m_sync(sync),
+      m_end(scan.end),
+      m_fileBytes(scan.validBytes) {
+    // A scan always covers the file header; anything less would cut the file.
+    TARN_ASSERT(scan.validBytes >= kHeaderBytes && scan.end >= scan.base);
+    Fd fd(::open(m_path.c_str(), O_WRONLY | O_CLOEXEC));
+    if (fd.Get() < 0) {
+        if (errno == ENOENT) {
+            throw RuntimeError("journal '" + m_path + "' does not exist");
+        }
+        IoError(m_path, "open for writing", errno);
+    }
+    struct stat st;
+    if (::fstat(fd.Get(), &st) != 0) {
+        IoError(m_path, "stat", errno);
+    }
+    const uint64 size = static_cast<uint64>(st.st_size);
+    if (size < m_fileBytes) {
+        throw RuntimeError("journal '" + m_path + "' is " + std::to_string(size) +
+                           " bytes, shorter than the " + std::to_string(m_fileBytes) +
+                           " bytes it held when scanned");
+    }
+    if (size > m_fileBytes) {
+        // Drop the torn tail so that the next record follows the last whole one.
+        if (::ftruncate(fd.Get(), static_cast<off_t>(m_fileBytes)) != 0) {
+            IoError(m_path, "cut its torn tail", errno);
+        }
+        if (m_sync && ::fdatasync(fd.Get()) != 0) {
+            IoError(m_path, "sync", errno);
+        }
+    }
+    m_payload.resize(kRecordHeaderBytes);
+    m_fd = fd.Release();
+}
+
+Journal::~Journal() {
+    if (m_fd >= 0) {
+        ::close(m_fd);
+    }
+}
+
+void Journal::Add(const JournalEntry& entry) {
+    if (entry.kind == JournalEntry::Kind::Clear) {
+        m_payload.push_back(kKindClear);
+        ++m_pendingCount;
+        return;
+    }
+    TARN_ASSERT(entry.kind == JournalEntry::Kind::Record);
+    // clang-format off
+    TARN_ASSERT(0 <= entry.t && entry.t <= 4294967295);
+    // clang-format on
+    const std::size_t pathLength = static_cast<std::size_t>(entry.field.path.size());
+    TARN_ASSERT(pathLength <= kMaxPathBytes);
+
+    std::size_t site = 0;
+    while (site < m_sites.size() && m_sites[site] != entry.site) {
+        ++site;
+    }
+    const std::size_t start = m_payload.size();
+    m_payload.resize(start + 1 + kGuidBytes + 5 * kMaxVarintBytes + pathLength);
+    octet_t* p = m_payload.data() + start;
+    *p++ = kKindRecord;
+    p = PutVarint(p, site);
+    if (site == m_sites.size()) {
+        m_sites.push_back(entry.site);
+        PutLe(p, entry.site.Data1, 4);
+        PutLe(p + 4, entry.site.Data2, 2);
+        PutLe(p + 6, entry.site.Data3, 2);
+        std::memcpy(p + 8, entry.site.Data4, sizeof entry.site.Data4);
+        p += kGuidBytes;
+    }
+    p = PutVarint(p, static_cast<uint64>(entry.t));
+    p = PutVarint(p, entry.field.oid.value_);
+    p = PutVarint(p, pathLength);
+    if (pathLength > 0) {
+        std::memcpy(p, entry.field.path.data(), pathLength);
+        p += pathLength;
+    }
+    const uint64 offset = static_cast<uint64>(entry.offset);
+    p = PutVarint(p, (offset << 1) ^ (~(offset >> 63) + 1));
+    m_payload.resize(static_cast<std::size_t>(p - m_payload.data()));
+    ++m_pendingCount;
+}
+
+void Journal::Commit() {
+    if (m_pendingCount == 0) {
+        return;
+    }
+    const std::size_t length = m_payload.size() - kRecordHeaderBytes;
+    if (length > kMaxPayload) {
+        throw RuntimeError("journal '" + m_path + "': cannot write a record of " +
+                           std::to_string(length) + " bytes, over the limit of " +
+                           std::to_string(kMaxPayload));
+    }
+    octet_t* header = m_payload.data();
+    const octet_t* payload = header + kRecordHeaderBytes;
+    std::memcpy(header, kRecordMagic, sizeof kRecordMagic);
+    PutLe(header + 4, length, 4);
+    PutLe(header + 8, m_end, 8);
+    PutLe(header + 16, m_pendingCount, 4);
+    PutLe(header + 20, RecordHeaderChecksum(header), 4);
+    PutLe(header + 24, XXH3_64bits_withSeed(payload, length, m_end), 8);
+    try {
+        // Written at the previous end rather than appended: a retry after a
+        // failure overwrites whatever part of this record got there.
+        WriteAll(m_fd, header, m_payload.size(), m_fileBytes, m_path);
+        if (m_sync && ::fdatasync(m_fd) != 0) {
+            IoError(m_path, "sync", errno);
+        }
+    } catch (...) {
+        // Best effort: the next open drops what remains as a torn tail.
+        if (::ftruncate(m_fd, static_cast<off_t>(m_fileBytes)) != 0) {
+        }
+        throw;
+    }
+    m_fileBytes += m_payload.size();
+    m_end += m_pendingCount;
+    m_pendingCount = 0;
+    m_payload.resize(kRecordHeaderBytes);
+    m_sites.clear();
+}
+
+}  // namespace tarn
+
+#endif  // TARN_HAVE_LMDB

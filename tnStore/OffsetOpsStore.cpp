@@ -1,0 +1,520 @@
+// Opening, recording, durable points, checkpoints and closing. The reading
+// half of the API is in OffsetOpsStoreRead.cpp.
+
+#include "tnStore/OffsetOpsStore.h"
+
+#include <algorithm>
+#include <filesystem>
+#include <utility>
+
+#include "tnRuntime/LmdbStore.h"
+#include "tnRuntime/MemoryStore.h"
+#include "tnStore/RegisterClasses.h"
+#include "tnStore/StoreImpl.h"
+
+namespace tarn {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+// A reader whose snapshot is older than the journal's first entry (the
+// writer checkpointed and started a new journal in between) takes a new
+// snapshot; this many times at most.
+constexpr int kReaderAttempts = 8;
+
+// Raised inside a reader's replay when the journal starts after its snapshot.
+struct SnapshotTooOld {};
+
+std::string JournalPath(const std::string& dir) {
+    return (fs::path(dir) / Journal::kFileName).string();
+}
+
+// Why `op` must not reach the record, or nothing. `table` is the field's
+// current table (null when the field has none).
+std::optional<RecordRefused> Refusal(const Opid& opid, const FieldId& field, int64 offset,
+                                     const OffsetOpsOnField<int64>* table) {
+    if (opid.t < 0 || opid.t > kMaxTimeStamp) {
+        return RecordRefused(RecordRefused::Reason::TimeStampOutOfRange, field, opid.s,
+                             "time stamp " + std::to_string(opid.t) + " of site " +
+                                 ToString(opid.s) + " for field " + ToString(field) +
+                                 " is outside 0.." + std::to_string(kMaxTimeStamp));
+    }
+    if (table == nullptr) {
+        return std::nullopt;
+    }
+    const auto& sites = table->m_map.getmap();
+    auto it = sites.find(opid.s);
+    if (it == sites.end()) {
+        return std::nullopt;
+    }
+    const SiteOffset<int64>& so = it->second;
+    if (opid.t < so.t) {
+        return RecordRefused(RecordRefused::Reason::TimeStampOlder, field, opid.s,
+                             "time stamp " + std::to_string(opid.t) + " of site " +
+                                 ToString(opid.s) + " is older than " + std::to_string(so.t) +
+                                 ", the one recorded for field " + ToString(field));
+    }
+    int64 sum;
+    if (__builtin_add_overflow(so.o, offset, &sum)) {
+        return RecordRefused(RecordRefused::Reason::SumOverflow, field, opid.s,
+                             "offset " + std::to_string(offset) + " would overflow the sum " +
+                                 std::to_string(so.o) + " of site " + ToString(opid.s) +
+                                 " for field " + ToString(field));
+    }
+    return std::nullopt;
+}
+
+// Records one operation after the refusal checks; the caller holds the space
+// exclusively.
+void CheckedRecord(OffsetOpsStore::Impl& s, const Opid& opid, const FieldId& field, int64 offset) {
+    FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
+    if (auto refusal = Refusal(opid, field, offset, map.rFind(field))) {
+        throw *refusal;
+    }
+    s.Record().RecordOffset(opid, field, offset);
+}
+
+// Replays one journal entry into the tree. A refused entry is damage: the
+// writer accepted every entry it journaled.
+void ReplayEntry(OffsetOpsStore::Impl& s, uint64 seq, const JournalEntry& e) {
+    if (e.kind == JournalEntry::Kind::Clear) {
+        s.Record().Clear();
+    } else {
+        try {
+            CheckedRecord(s, Opid(e.site, e.t), e.field, e.offset);
+        } catch (const RecordRefused& refused) {
+            throw RuntimeError("journal '" + JournalPath(s.dir) + "': entry " +
+                               std::to_string(seq) + " cannot be replayed: " + refused.what());
+        }
+    }
+    ++s.replayed;
+}
+
+// The record of the space: the root's, or (writers of a store without one)
+// a new record, committed at once with the journal position 0.
+void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
+    CSpace& space = *s.space;
+    OID oid = space.GetRoot(kRecordRoot);
+    if (oid.IsNull()) {
+        if (s.reader) {
+            throw RuntimeError("store '" + s.dir + "' holds no offsets record yet");
+        }
+        CSpaceGuard guard(space, LockMode::Exclusive);
+        OffsetOps* created = CreatePersistent<OffsetOps>();
+        oid = created->GetPersistObjState().m_oid;
+        space.SetRoot(kRecordRoot, oid);
+        space.SetCounter(kJournalPositionCounter, 0);
+        space.Commit();
+    }
+    s.record = std::make_unique<SpaceRef<OffsetOps>>(space, oid);
+    CSpaceGuard guard(space, LockMode::Exclusive);
+    // Loads the record and its map now, so that a root of another class or a
+    // damaged image is reported before anything else happens.
+    (void)s.Map();
+}
+
+// Checks the stored tree before anything walks it: the map's own code
+// trusts every node to be what its level says.
+void CheckStoredTree(OffsetOpsStore::Impl& s) {
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.openCheck = CheckTree(s.Map());
+    if (!s.reader && !s.openCheck.Ok()) {
+        throw RuntimeError("store '" + s.dir + "': the stored tree is damaged (" +
+                           std::to_string(s.openCheck.numProblems) + " problems; the first: " +
+                           s.openCheck.problems.front() + "); run 'offsetops validate' for all");
+    }
+    if (s.options.cacheObjects > 0) {
+        s.space->EvictCleanResidents(s.options.cacheObjects / 2);
+    }
+}
+
+std::unique_ptr<LmdbStore> OpenLmdb(const std::string& dir, const StoreOptions& options) {
+    LmdbStoreOptions lmdb;
+    lmdb.mode = options.mode == StoreMode::Read            ? OpenMode::ReadOnly
+                : options.mode == StoreMode::WriteExisting ? OpenMode::MustExist
+                                                           : OpenMode::CreateIfMissing;
+    lmdb.syncOnCommit = options.sync;
+    return LmdbStore::Open(dir, lmdb);
+}
+
+void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
+    s.record.reset();
+    s.space.reset();
+    s.store = std::make_shared<CountingStore>(std::move(store));
+    s.space = std::make_unique<CSpace>(s.store);
+    s.checkpointed = s.space->GetCounter(kJournalPositionCounter).value_or(0);
+}
+
+// Writer: the journal after the last checkpoint, replayed; a torn tail cut.
+void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
+    const std::string path = JournalPath(s.dir);
+    std::error_code ec;
+    if (!fs::exists(path, ec)) {
+        if (!legacy) {
+            throw RuntimeError("journal '" + path +
+                               "' is missing: the store's last checkpoint "
+                               "covers " +
+                               std::to_string(s.checkpointed) +
+                               " operations, and any made durable after it are lost");
+        }
+        Journal::Reset(s.dir, s.checkpointed, s.options.sync);
+        s.repairs.push_back("started a journal in '" + s.dir +
+                            "', which had none (a store made before journals)");
+    }
+    JournalScan scan;
+    {
+        CSpaceGuard guard(*s.space, LockMode::Exclusive);
+        scan = Journal::Scan(path, s.checkpointed,
+                             [&](uint64 seq, const JournalEntry& e) { ReplayEntry(s, seq, e); });
+    }
+    if (scan.base > s.checkpointed) {
+        throw RuntimeError("journal '" + path + "' begins at operation " +
+                           std::to_string(scan.base) + " but the store's last checkpoint covers " +
+                           std::to_string(s.checkpointed) + ": the operations between are lost");
+    }
+    if (scan.tornTail()) {
+        s.repairs.push_back("dropped " + std::to_string(scan.fileBytes - scan.validBytes) +
+                            " bytes of an incomplete last record from journal '" + path +
+                            "' (an append cut short by a crash)");
+    }
+    s.journal = std::make_unique<Journal>(s.dir, scan, s.options.sync);
+    s.durable = std::max(scan.end, s.checkpointed);
+    if (scan.end < s.checkpointed) {
+        // The journal lost entries the checkpoint already holds: start anew.
+        Journal::Reset(s.dir, s.checkpointed, s.options.sync);
+        s.journal =
+            std::make_unique<Journal>(s.dir,
+                                      JournalScan{s.checkpointed, s.checkpointed,
+                                                  Journal::kHeaderBytes, Journal::kHeaderBytes},
+                                      s.options.sync);
+        s.repairs.push_back("journal '" + path +
+                            "' ended before the last checkpoint; started a "
+                            "new one after it");
+    }
+}
+
+void OpenWriter(OffsetOpsStore::Impl& s) {
+    OpenSpace(s, OpenLmdb(s.dir, s.options));
+    // A store made before journals has neither journal nor position counter.
+    const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
+    const bool fresh = s.space->GetRoot(kRecordRoot).IsNull();
+    if (fresh && !fs::exists(JournalPath(s.dir))) {
+        Journal::Reset(s.dir, s.checkpointed, s.options.sync);
+    }
+    FindOrCreateRecord(s);
+    CheckStoredTree(s);
+    OpenJournalForWriting(s, legacy && !fresh);
+}
+
+// Reader: one snapshot of the last checkpoint, plus the journal's complete
+// records after it, replayed into memory.
+void OpenReader(OffsetOpsStore::Impl& s) {
+    const std::string path = JournalPath(s.dir);
+    for (int attempt = 1;; ++attempt) {
+        OpenSpace(s, OpenLmdb(s.dir, s.options));
+        const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
+        FindOrCreateRecord(s);
+        CheckStoredTree(s);
+        std::error_code ec;
+        if (!fs::exists(path, ec)) {
+            if (legacy) {
+                return;
+            }
+            throw RuntimeError("journal '" + path +
+                               "' is missing: the store's last checkpoint "
+                               "covers " +
+                               std::to_string(s.checkpointed) +
+                               " operations, and any made durable after it are lost");
+        }
+        if (!s.openCheck.Ok()) {
+            return;  // nothing is replayed into a damaged tree
+        }
+        s.replayed = 0;
+        try {
+            CSpaceGuard guard(*s.space, LockMode::Exclusive);
+            bool first = true;
+            JournalScan scan =
+                Journal::Scan(path, s.checkpointed, [&](uint64 seq, const JournalEntry& e) {
+                    if (first && seq != s.checkpointed) {
+                        throw SnapshotTooOld{};
+                    }
+                    first = false;
+                    ReplayEntry(s, seq, e);
+                });
+            if (scan.base > s.checkpointed) {
+                throw SnapshotTooOld{};
+            }
+            s.durable = std::max(scan.end, s.checkpointed);
+            s.journalBytes = scan.validBytes;
+            return;
+        } catch (const SnapshotTooOld&) {
+            if (attempt == kReaderAttempts) {
+                throw RuntimeError("journal '" + path +
+                                   "' keeps moving past the store's "
+                                   "checkpoints; try again");
+            }
+        }
+    }
+}
+
+}  // namespace
+
+// --- Impl ----------------------------------------------------------------------
+
+ssize_t OperationHeadroom(ssize_t height) {
+    const ssize_t h = std::max<ssize_t>(height, 0);
+    // record + map header + a root-to-leaf path (h+1) + the split leaf's
+    // successor + one new node per level (h+1) + a new root
+    return 2 + (h + 1) + 1 + (h + 1) + 1;
+}
+
+ssize_t OffsetOpsStore::MinCacheObjects(ssize_t height) {
+    return 2 * OperationHeadroom(height);
+}
+
+void OffsetOpsStore::Impl::RequireOpen() const {
+    if (closed) {
+        throw RuntimeError("the store" + (dir.empty() ? std::string() : " '" + dir + "'") +
+                           " is closed");
+    }
+}
+
+void OffsetOpsStore::Impl::RequireWritable() const {
+    RequireOpen();
+    if (reader) {
+        throw RuntimeError("store '" + dir + "' is open for reading only");
+    }
+    if (broken) {
+        throw RuntimeError("the store" + (dir.empty() ? std::string() : " '" + dir + "'") +
+                           " stopped accepting writes after an earlier error; it keeps its "
+                           "last durable point");
+    }
+}
+
+void OffsetOpsStore::Impl::RequireSoundTree() const {
+    if (!openCheck.Ok()) {
+        throw RuntimeError("store '" + dir + "': the stored tree is damaged (" +
+                           std::to_string(openCheck.numProblems) + " problems; the first: " +
+                           openCheck.problems.front() + "); run 'offsetops validate' for all");
+    }
+}
+
+// Before each operation: room for the most one operation can add. Clean
+// objects are released; the changed objects of operations that are not yet
+// durable stay until the next durable point checkpoints them.
+void OffsetOpsStore::Impl::MakeRoom() {
+    const ssize_t bound = options.cacheObjects;
+    if (bound <= 0) {
+        return;
+    }
+    const ssize_t height = Map().m_height;
+    const ssize_t room = OperationHeadroom(height);
+    const ssize_t limit = bound - room;
+    if (limit < room) {
+        throw RuntimeError("a cache of " + std::to_string(bound) +
+                           " objects is too small for a tree of height " + std::to_string(height) +
+                           ": it needs at least " + std::to_string(2 * room));
+    }
+    if (space->NumResidents() > limit) {
+        space->EvictCleanResidents(limit / 2);
+    }
+}
+
+// A checkpoint: the changed nodes and the journal position they reach, in
+// one store transaction; then a new, empty journal. Runs only at a durable
+// point, so that the stored tree never holds an operation the journal could
+// lose. A failure before the transaction ends leaves memory and store as
+// they were (the checkpoint can be retried).
+void OffsetOpsStore::Impl::WriteCheckpoint() {
+    {
+        CSpaceGuard guard(*space, LockMode::Exclusive);
+        space->SetCounter(kJournalPositionCounter, durable);
+        space->Commit();
+        checkpointed = durable;
+        ++checkpoints;
+        if (options.cacheObjects > 0) {
+            space->EvictCleanResidents(options.cacheObjects / 2);
+        }
+    }
+    if (journal != nullptr && journal->FileBytes() > Journal::kHeaderBytes) {
+        Journal::Reset(dir, durable, options.sync);
+        journal = std::make_unique<Journal>(
+            dir, JournalScan{durable, durable, Journal::kHeaderBytes, Journal::kHeaderBytes},
+            options.sync);
+    }
+}
+
+void OffsetOpsStore::Impl::Release() {
+    record.reset();
+    space.reset();
+    journal.reset();
+    store.reset();
+    closed = true;
+}
+
+// --- Opening and closing -----------------------------------------------------------
+
+OffsetOpsStore::OffsetOpsStore(std::unique_ptr<Impl> impl) : m_impl(std::move(impl)) {}
+OffsetOpsStore::OffsetOpsStore(OffsetOpsStore&&) noexcept = default;
+OffsetOpsStore& OffsetOpsStore::operator=(OffsetOpsStore&& rhs) noexcept {
+    if (this != &rhs) {
+        if (m_impl != nullptr) {
+            try {
+                Close();
+            } catch (...) {
+                m_impl->Release();
+            }
+        }
+        m_impl = std::move(rhs.m_impl);
+    }
+    return *this;
+}
+
+OffsetOpsStore::~OffsetOpsStore() {
+    if (m_impl == nullptr) {
+        return;
+    }
+    try {
+        Close();
+    } catch (...) {
+        m_impl->Release();
+    }
+}
+
+OffsetOpsStore OffsetOpsStore::Open(const std::string& dir, const StoreOptions& options) {
+    RegisterOffsetOpsClasses();
+    auto impl = std::make_unique<Impl>();
+    impl->dir = dir;
+    impl->options = options;
+    impl->reader = options.mode == StoreMode::Read;
+    if (impl->reader) {
+        OpenReader(*impl);
+    } else {
+        OpenWriter(*impl);
+    }
+    impl->peakResidents = impl->space->NumResidents();
+    return OffsetOpsStore(std::move(impl));
+}
+
+OffsetOpsStore OffsetOpsStore::OpenInMemory(const StoreOptions& options) {
+    RegisterOffsetOpsClasses();
+    auto impl = std::make_unique<Impl>();
+    impl->options = options;
+    impl->options.mode = StoreMode::Write;
+    OpenSpace(*impl, std::make_unique<MemoryStore>());
+    FindOrCreateRecord(*impl);
+    return OffsetOpsStore(std::move(impl));
+}
+
+void OffsetOpsStore::Close() {
+    Impl& s = *m_impl;
+    if (s.closed) {
+        return;
+    }
+    if (!s.reader && !s.broken) {
+        try {
+            Sync();
+            const bool changed =
+                s.space->NumDirty() > 0 || s.space->NumQueuedDeletions() > 0 ||
+                s.checkpointed != s.durable ||
+                (s.journal != nullptr && s.journal->FileBytes() > Journal::kHeaderBytes);
+            if (changed) {
+                s.WriteCheckpoint();
+            }
+        } catch (...) {
+            s.Release();
+            throw;
+        }
+    }
+    s.Release();
+}
+
+bool OffsetOpsStore::IsReader() const {
+    return m_impl->reader;
+}
+
+const std::string& OffsetOpsStore::Directory() const {
+    return m_impl->dir;
+}
+
+const std::vector<std::string>& OffsetOpsStore::Repairs() const {
+    return m_impl->repairs;
+}
+
+// --- Writing -------------------------------------------------------------------------
+
+void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset) {
+    Impl& s = *m_impl;
+    s.RequireWritable();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    try {
+        s.MakeRoom();
+        CheckedRecord(s, opid, field, offset);
+    } catch (const RecordRefused&) {
+        throw;
+    } catch (...) {
+        // A load that failed inside the write-find may leave the tree half
+        // changed in memory: nothing more may become durable.
+        s.broken = true;
+        throw;
+    }
+    if (s.journal != nullptr) {
+        JournalEntry entry;
+        entry.site = opid.s;
+        entry.t = opid.t;
+        entry.field = field;
+        entry.offset = offset;
+        try {
+            s.journal->Add(entry);
+        } catch (...) {
+            s.broken = true;
+            throw;
+        }
+    }
+    ++s.pending;
+    s.peakResidents = std::max(s.peakResidents, s.space->NumResidents());
+}
+
+void OffsetOpsStore::Clear() {
+    Impl& s = *m_impl;
+    s.RequireWritable();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    try {
+        s.Record().Clear();
+        if (s.journal != nullptr) {
+            JournalEntry entry;
+            entry.kind = JournalEntry::Kind::Clear;
+            s.journal->Add(entry);
+        }
+    } catch (...) {
+        s.broken = true;
+        throw;
+    }
+    ++s.pending;
+}
+
+void OffsetOpsStore::Sync() {
+    Impl& s = *m_impl;
+    s.RequireWritable();
+    if (s.journal != nullptr) {
+        s.journal->Commit();  // a failure keeps the entries pending: Sync may be retried
+    }
+    s.durable += static_cast<uint64>(s.pending);
+    s.pending = 0;
+    const bool journalFull =
+        s.journal != nullptr && s.journal->FileBytes() > s.options.journalLimitBytes;
+    const bool cacheFull = s.options.cacheObjects > 0 &&
+                           s.space->NumResidents() > s.options.cacheObjects &&
+                           s.space->NumDirty() > 0;
+    if (journalFull || cacheFull) {
+        s.WriteCheckpoint();
+    }
+}
+
+void OffsetOpsStore::Checkpoint() {
+    Sync();
+    m_impl->WriteCheckpoint();
+}
+
+}  // namespace tarn

@@ -1,0 +1,191 @@
+// The reading half of the API: lookups, ordered walks, statistics, checks
+// and the dump.
+
+#include <utility>
+
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
+#include "tnStore/OffsetOpsStore.h"
+#include "tnStore/Reachability.h"
+#include "tnStore/StoreImpl.h"
+#include "tnStore/TreeWalk.h"
+#include "tnUtils/OstreamOutputStream.h"
+#include "tnUtils/xostream.h"
+
+namespace tarn {
+
+namespace {
+
+// Ordered walks hand their callback copies of this many entries at a time,
+// taken with the space held; the callback runs without it, so it may even
+// call the store, and a bounded cache stays bounded between batches.
+constexpr std::size_t kWalkBatch = 256;
+
+using Entry = std::pair<FieldId, OffsetOpsOnField<int64>>;
+
+}  // namespace
+
+StoreCheck CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map) {
+    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result =
+        FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
+    StoreCheck check;
+    check.problems = std::move(result.problems);
+    check.numProblems = result.numProblems;
+    return check;
+}
+
+std::optional<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field) {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    s.RequireSoundTree();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.MakeRoom();
+    const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
+    if (table == nullptr) {
+        return std::nullopt;
+    }
+    return *table;
+}
+
+void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    s.RequireSoundTree();
+    std::vector<Entry> batch;
+    batch.reserve(kWalkBatch);
+    FieldId key = from;
+    bool inclusive = true;
+    for (;;) {
+        batch.clear();
+        {
+            CSpaceGuard guard(*s.space, LockMode::Exclusive);
+            s.MakeRoom();
+            const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
+            auto it = inclusive ? map.lower_bound(key) : map.upper_bound(key);
+            for (; it != map.end() && batch.size() < kWalkBatch; ++it) {
+                batch.emplace_back(it->first, it->second);
+            }
+        }
+        for (const Entry& e : batch) {
+            if (!fn(e.first, e.second)) {
+                return;
+            }
+        }
+        if (batch.size() < kWalkBatch) {
+            return;
+        }
+        key = batch.back().first;
+        inclusive = false;
+    }
+}
+
+void OffsetOpsStore::ForEachOfObject(OID oid, const FieldVisitor& fn) {
+    ForEachFrom(FieldId(oid, Path()), [&](const FieldId& field, const OffsetOpsOnField<int64>& t) {
+        return field.oid == oid && fn(field, t);
+    });
+}
+
+int64 OffsetOpsStore::Size() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    return s.Map().size();
+}
+
+StoreStatistics OffsetOpsStore::Stats() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    StoreStatistics stats;
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    stats.fields = s.Map().size();
+    stats.height = s.Map().m_height;
+    if (s.openCheck.Ok()) {
+        const TreeShape shape =
+            WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects, {});
+        stats.leaves = shape.leaves;
+        stats.internalNodes = shape.internalNodes;
+    }
+    const StoreStats stored = s.store->Stats();
+    stats.images = stored.numImages;
+    stats.imageBytes = stored.numImageBytes;
+    stats.journalBytes =
+        static_cast<int64>(s.journal != nullptr ? s.journal->FileBytes() : s.journalBytes);
+    stats.durableOperations = s.durable;
+    stats.checkpointedOperations = s.checkpointed;
+    stats.pendingOperations = s.pending;
+    stats.checkpoints = s.checkpoints;
+    stats.imagesWritten = s.store->ImagesWritten();
+    stats.imageBytesWritten = s.store->BytesWritten();
+    stats.residents = s.space->NumResidents();
+    stats.peakResidents = s.peakResidents;
+    stats.replayedOperations = s.replayed;
+    return stats;
+}
+
+StoreCheck OffsetOpsStore::Check() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    StoreCheck check = CheckTree(s.Map());
+    if (s.options.cacheObjects > 0) {
+        s.space->EvictCleanResidents(s.options.cacheObjects / 2);
+    }
+    return check;
+}
+
+// The unreachable images are those of the store as it is (a reader's
+// snapshot, a writer's last checkpoint), so they are counted in a second
+// space over the same store, which holds no operation of the journal.
+StoreValidation OffsetOpsStore::Validate() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    StoreValidation v;
+    {
+        CSpaceGuard guard(*s.space, LockMode::Exclusive);
+        v.record = s.record->m_oid;
+        v.map = s.Record().m_map.m_oid;
+        const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
+        FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
+            FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
+        if (check.Ok()) {
+            // The map's own checker stops the process on a broken invariant,
+            // so it runs only on a tree that passed the check above.
+            map.Validate();
+            v.mapValid = true;
+            const ssize_t counted = map.GetNumNodes();
+            if (counted != check.Nodes()) {
+                check.problems.push_back("the map counts " + std::to_string(counted) +
+                                         " nodes, the walk found " + std::to_string(check.Nodes()));
+                ++check.numProblems;
+                v.mapValid = false;
+            }
+        }
+        v.check.problems = std::move(check.problems);
+        v.check.numProblems = check.numProblems;
+        if (s.options.cacheObjects > 0) {
+            s.space->EvictCleanResidents(s.options.cacheObjects / 2);
+        }
+    }
+    CSpace stored(s.store);
+    CSpaceGuard guard(stored, LockMode::Shared);
+    ReachabilityResult reach = FindUnreachableImages(stored);
+    v.images = reach.stored;
+    v.reached = reach.reached;
+    v.unreachable = std::move(reach.unreachable);
+    for (std::string& e : reach.errors) {
+        v.check.problems.push_back(std::move(e));
+        ++v.check.numProblems;
+    }
+    return v;
+}
+
+void OffsetOpsStore::Dump(std::ostream& out) {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    s.RequireSoundTree();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    OstreamOutputStream sink(out);
+    xostream os(sink);
+    s.Map().Write(os);
+}
+
+}  // namespace tarn

@@ -1,0 +1,80 @@
+#pragma once
+
+// The state behind an OffsetOpsStore handle, shared by its writing
+// (OffsetOpsStore.cpp) and reading (OffsetOpsStoreRead.cpp) halves.
+//
+// Positions: `durable` is the sequence number after the last journaled
+// entry, `checkpointed` the number of entries the store's last checkpoint
+// covers (its "journal-position" counter), `pending` the entries recorded
+// since the last durable point. The tree in memory always holds
+// durable + pending entries; the stored tree holds `checkpointed`.
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
+#include "tnRuntime/CSpace.h"
+#include "tnRuntime/CSpaceGuard.h"
+#include "tnRuntime/SpaceRef.h"
+#include "tnStore/CountingStore.h"
+#include "tnStore/Journal.h"
+#include "tnStore/OffsetOpsStore.h"
+
+namespace tarn {
+
+// The named root under which a store keeps its offsets record, and the
+// counter that holds the journal position of the last checkpoint.
+inline constexpr const char* kRecordRoot = "offsets";
+inline constexpr const char* kJournalPositionCounter = "journal-position";
+
+struct OffsetOpsStore::Impl {
+    std::string dir;  // "" for an in-memory store
+    StoreOptions options;
+    bool reader = false;
+    bool broken = false;  // a write failed half way: no more writes
+    bool closed = false;
+
+    std::shared_ptr<CountingStore> store;
+    std::unique_ptr<CSpace> space;
+    std::unique_ptr<SpaceRef<OffsetOps>> record;
+    std::unique_ptr<Journal> journal;  // writers of on-disk stores
+
+    uint64 durable = 0;
+    uint64 checkpointed = 0;
+    int64 pending = 0;
+    uint64 journalBytes = 0;  // readers: the journal bytes replayed
+
+    // The tree check made when the store was opened: readers refuse to walk a
+    // tree that failed it (writers refuse to open one).
+    StoreCheck openCheck;
+
+    int64 checkpoints = 0;
+    int64 replayed = 0;
+    ssize_t peakResidents = 0;
+    std::vector<std::string> repairs;
+
+    FieldIdToOffsetOpsOnInt64FieldMap& Map() { return *(*record)->m_map; }
+    OffsetOps& Record() { return **record; }
+
+    // Throws when the handle is closed, or (for writes) a reader or broken.
+    void RequireOpen() const;
+    void RequireWritable() const;
+    // Throws RuntimeError when the tree failed the check made at opening.
+    void RequireSoundTree() const;
+    // Releases clean residents so that one more operation fits under the
+    // cache bound. Needs the space exclusively.
+    void MakeRoom();
+    // Writes the tree and the journal position (after a durable point).
+    void WriteCheckpoint();
+    void Release();
+};
+
+// The fewest objects an operation needs resident in a tree of `height`.
+ssize_t OperationHeadroom(ssize_t height);
+
+// The non-aborting tree check of `map`, as the API reports it.
+StoreCheck CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map);
+
+}  // namespace tarn
