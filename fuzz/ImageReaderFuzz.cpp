@@ -22,8 +22,8 @@
 #include <memory>
 
 #include "fuzz/FuzzStore.h"
-#include "tnOperation/RegisterClasses.h"
 #include "tnRuntime/ClassRegistry.h"
+#include "tnStore/RegisterClasses.h"
 
 // The classes are looked up by name before the first space exists.
 extern "C" int LLVMFuzzerInitialize(int* /*argc*/, char*** /*argv*/) {

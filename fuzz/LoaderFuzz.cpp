@@ -20,8 +20,8 @@
 #include <memory>
 
 #include "fuzz/FuzzStore.h"
-#include "tnOperation/RegisterClasses.h"
 #include "tnRuntime/ClassRegistry.h"
+#include "tnStore/RegisterClasses.h"
 
 namespace {
 

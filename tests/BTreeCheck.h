@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <memory>
 #include <sstream>
 #include <string>
@@ -21,6 +22,7 @@
 #include "tnRuntime/ClassRegistry.h"
 #include "tnRuntime/MemoryStore.h"
 #include "tnRuntime/RuntimeCallLog.h"
+#include "tnStore/RegisterClasses.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/MemoryOutputStream.h"
 
@@ -130,20 +132,8 @@ inline Bytes Le64(uint64 v) {
 
 // ---- Runtime helpers ---------------------------------------------------------
 
-// Registers the three tree classes once per process, so that their images can
-// be loaded by class name.
-inline void RegisterBTreeClasses() {
-    if (FindReflectedClass("tarn::FieldIdToOffsetOpsOnInt64FieldMap") == nullptr) {
-        _Register_FieldIdToOffsetOpsOnInt64FieldMap();
-        _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode();
-        _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode();
-    }
-}
-
-// An in-memory store that remembers the identities each commit wrote, in the
-// order the space queued them: registration of a new object or the first
-// dirty mark since the previous commit. That order makes the sequence of dirty
-// marks of one operation observable.
+// An in-memory store that remembers the identities each commit wrote (the
+// space hands them over in identity order).
 class RecordingStore final : public IStore {
 public:
     std::optional<StoredImage> Load(uint64 oid) override { return m_store.Load(oid); }
@@ -151,6 +141,9 @@ public:
         return m_store.FindRoot(name);
     }
     std::map<std::string, uint64> Roots() override { return m_store.Roots(); }
+    std::optional<uint64> FindCounter(std::string_view name) override {
+        return m_store.FindCounter(name);
+    }
     uint64 NextIdentity() override { return m_store.NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
         m_lastWrites.clear();
@@ -190,7 +183,7 @@ protected:
         : m_store(std::make_shared<RecordingStore>()),
           m_space(m_store),
           m_guard(m_space, LockMode::Exclusive) {
-        RegisterBTreeClasses();
+        RegisterOffsetOpsClasses();
         m_map = DollarNew(new Map());
         GetThreadRuntimeCallLog() = RuntimeCallLog();
     }
@@ -204,10 +197,23 @@ protected:
         GetThreadRuntimeCallLog() = RuntimeCallLog();
     }
 
-    // The identities written by the next commit, in queue order.
+    // The identities written by the next commit, in the order the space
+    // queued them: registration of a new object or the first dirty mark since
+    // the previous commit. That order makes the sequence of dirty marks of
+    // one operation observable. The store receives them in identity order.
     std::vector<uint64> CommitAndListWrites() {
+        const std::vector<OID> queued = m_space.DirtyInQueueOrder();
         m_space.Commit();
-        return m_store->m_lastWrites;
+        const std::vector<uint64>& written = m_store->m_lastWrites;
+        EXPECT_TRUE(std::is_sorted(written.begin(), written.end()));
+        std::vector<uint64> inQueueOrder;
+        for (const OID& id : queued) {
+            if (std::binary_search(written.begin(), written.end(), id.value_)) {
+                inQueueOrder.push_back(id.value_);
+            }
+        }
+        EXPECT_EQ(inQueueOrder.size(), written.size());
+        return inQueueOrder;
     }
 
     RuntimeCallLog& Log() { return GetThreadRuntimeCallLog(); }

@@ -11,6 +11,7 @@
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/MemoryStore.h"
+#include "tnStore/RegisterClasses.h"
 
 namespace tarn {
 namespace {
@@ -37,6 +38,7 @@ std::string LoadError(const char* className, const Bytes& image) {
     batch.writes.emplace_back(1, StoredImage{className, image});
     batch.nextIdentity = 2;
     store->Commit(batch);
+    RegisterOffsetOpsClasses();
     CSpace space(store);
     CSpaceGuard guard(space, LockMode::Exclusive);
     try {

@@ -1,6 +1,7 @@
 // The LMDB store: contents survive reopening, commits are atomic even when
-// the writer is killed, damage is reported, and foreign or missing
-// directories are refused.
+// the writer is killed, damage is reported, foreign or missing directories
+// are refused, and readers in other processes keep their snapshot beside the
+// one writer.
 
 #include "tnRuntime/LmdbStore.h"
 
@@ -70,7 +71,8 @@ StoredImage MakeImage(uint64 seed, uint64 oid, std::size_t size) {
 
 // Commit number `k` of a deterministic history: a few images among 300
 // identities (now and then one spanning several pages), a few deletions, the
-// root "head" naming k and the counter k + 1.
+// root "head" naming k, the counter "journal" at 10 k (now and then another
+// counter) and the identity counter k + 1.
 CommitBatch MakeCommit(uint64 k) {
     std::mt19937_64 rng(k);
     CommitBatch batch;
@@ -84,6 +86,10 @@ CommitBatch MakeCommit(uint64 k) {
     }
     batch.roots["head"] = k;
     batch.roots["slot" + std::to_string(k % 5)] = 1 + rng() % 300;
+    batch.counters["journal"] = 10 * k;
+    if (k % 4 == 0) {
+        batch.counters["c" + std::to_string(k % 3)] = rng();
+    }
     batch.nextIdentity = k + 1;
     return batch;
 }
@@ -92,6 +98,7 @@ CommitBatch MakeCommit(uint64 k) {
 struct Model {
     std::map<uint64, StoredImage> images;
     std::map<std::string, uint64> roots;
+    std::map<std::string, uint64> counters;
     uint64 next = 1;
 
     void Apply(const CommitBatch& batch) {
@@ -103,6 +110,9 @@ struct Model {
         }
         for (const auto& [name, oid] : batch.roots) {
             roots[name] = oid;
+        }
+        for (const auto& [name, value] : batch.counters) {
+            counters[name] = value;
         }
         next = batch.nextIdentity;
     }
@@ -121,6 +131,12 @@ struct Model {
         });
         EXPECT_TRUE(expected == images.end());
         EXPECT_EQ(store.Roots(), roots);
+        for (const char* name : {"journal", "c0", "c1", "c2"}) {
+            const auto it = counters.find(name);
+            EXPECT_EQ(store.FindCounter(name),
+                      it == counters.end() ? std::nullopt : std::optional(it->second))
+                << name;
+        }
         EXPECT_EQ(store.NextIdentity(), next);
         EXPECT_EQ(store.Stats().numImages, static_cast<ssize_t>(images.size()));
         EXPECT_EQ(store.Stats().numImageBytes, bytes);
@@ -323,11 +339,14 @@ TEST(LmdbStoreOpening, MissingAndForeignDirectoriesAreRefused) {
     EXPECT_FALSE(fs::exists(missing));
 }
 
-TEST(LmdbStoreOpening, OneOpenerAtATimeAndReadersCannotCommit) {
+// Within one process a store is open once, whatever the modes; a reader
+// cannot commit.
+TEST(LmdbStoreOpening, OneOpenerPerProcessAndReadersCannotCommit) {
     TempDir dir;
     auto first = LmdbStore::Open(dir.Path(), OpenMode::CreateIfMissing);
     EXPECT_ERROR_MENTIONS(LmdbStore::Open(dir.Path(), OpenMode::MustExist), "in use");
-    EXPECT_ERROR_MENTIONS(LmdbStore::Open(dir.Path(), OpenMode::ReadOnly), "in use");
+    EXPECT_ERROR_MENTIONS(LmdbStore::Open(dir.Path(), OpenMode::ReadOnly),
+                          "in use: the store is already open in this process");
     CommitBatch zero;
     zero.writes.emplace_back(0, StoredImage{});
     EXPECT_TARN_ASSERT(first->Commit(zero), "write.first != 0");
@@ -339,6 +358,86 @@ TEST(LmdbStoreOpening, OneOpenerAtATimeAndReadersCannotCommit) {
     model.ExpectHeldBy(*reader);
     EXPECT_ERROR_MENTIONS(LmdbStore::Open(dir.Path(), OpenMode::MustExist), "in use");
     EXPECT_TARN_ASSERT(reader->Commit(CommitBatch{}), "!m_readOnly");
+}
+
+// The writer of the reader test, in a child process: opens the store and
+// answers 'o'; then for each 'c' on `in` commits the next 60 commits of the
+// history (growing the map) and answers 'd'; ends at 'q'.
+[[noreturn]] void RunSteppedWriter(const std::string& dir, int in, int out) {
+    try {
+        auto store = OpenScratch(dir, OpenMode::MustExist);
+        char c = 'o';
+        for (;;) {
+            if (::write(out, &c, 1) != 1 || ::read(in, &c, 1) != 1) {
+                ::_exit(3);
+            }
+            if (c == 'q') {
+                ::_exit(0);
+            }
+            for (int i = 0; i < 60; ++i) {
+                store->Commit(MakeCommit(store->NextIdentity()));
+            }
+            c = 'd';
+        }
+    } catch (const RuntimeError&) {
+        ::_exit(2);
+    }
+}
+
+// A writer in another process: a second writer is refused at once, readers
+// open beside it, and a reader keeps the commit it opened at while the
+// writer commits on; a reader opened later sees the later commits.
+TEST(LmdbStoreOpening, ReadersBesideAWriterInAnotherProcessKeepTheirSnapshot) {
+    TempDir dir;
+    Model model;
+    {
+        auto store = OpenScratch(dir.Path(), OpenMode::CreateIfMissing, 256 * 1024);
+        for (uint64 k = 1; k <= 3; ++k) {
+            store->Commit(MakeCommit(k));
+            model.Apply(MakeCommit(k));
+        }
+    }  // nothing of the store is open across the fork
+    int toChild[2];
+    int fromChild[2];
+    ASSERT_EQ(::pipe(toChild), 0);
+    ASSERT_EQ(::pipe(fromChild), 0);
+    const pid_t pid = ::fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        ::close(toChild[1]);
+        ::close(fromChild[0]);
+        RunSteppedWriter(dir.Path(), toChild[0], fromChild[1]);
+    }
+    ::close(toChild[0]);
+    ::close(fromChild[1]);
+    const auto tell = [&](char c) {
+        char answer = 0;
+        return (c == 0 || ::write(toChild[1], &c, 1) == 1) && ::read(fromChild[0], &answer, 1) == 1
+                   ? answer
+                   : char{0};
+    };
+    ASSERT_EQ(tell(0), 'o');
+    EXPECT_ERROR_MENTIONS(LmdbStore::Open(dir.Path(), OpenMode::MustExist),
+                          "in use: another writer (in this or another process) holds the store");
+    {
+        auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+        EXPECT_EQ(tell('c'), 'd');
+        model.ExpectHeldBy(*reader);  // still commit 3
+    }
+    auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+    EXPECT_GT(reader->MapSize(), 256u * 1024);  // grown by the writer, adopted
+    while (model.next < 64) {
+        model.Apply(MakeCommit(model.next));
+    }
+    model.ExpectHeldBy(*reader);
+    EXPECT_EQ(tell('c'), 'd');
+    model.ExpectHeldBy(*reader);
+    EXPECT_EQ(tell('q'), char{0});
+    int status = 0;
+    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "status " << status;
+    ::close(toChild[1]);
+    ::close(fromChild[0]);
 }
 
 }  // namespace

@@ -11,9 +11,9 @@
 
 #include "tests/AssertDeath.h"
 #include "tests/BTreeCheck.h"
-#include "tnOperation/RegisterClasses.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/SpaceRef.h"
+#include "tnStore/RegisterClasses.h"
 #include "tnUtils/xostream.h"
 
 namespace tarn {
@@ -44,6 +44,8 @@ Opid Op(uint32 site, int64 t) {
 
 class OffsetOpsTest : public ::testing::Test {
 protected:
+    static void SetUpTestSuite() { RegisterOffsetOpsClasses(); }
+
     CSpace space;
 };
 

@@ -1,6 +1,6 @@
 // The runtime: identities, dirty tracking and commit, eviction and reloading,
-// deferred deletion, commit atomicity, named roots, the loader's checks and
-// the runtime's own assertions.
+// deferred deletion, commit atomicity, named roots and counters, the loader's
+// checks and the runtime's own assertions.
 
 #include <gtest/gtest.h>
 
@@ -13,9 +13,10 @@
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/MemoryStore.h"
-#include "tnUtils/RuntimeError.h"
 #include "tnRuntime/SpaceRef.h"
+#include "tnStore/RegisterClasses.h"
 #include "tnUtils/MemoryOutputStream.h"
+#include "tnUtils/RuntimeError.h"
 
 namespace tarn {
 namespace {
@@ -31,6 +32,9 @@ public:
         return m_inner->FindRoot(name);
     }
     std::map<std::string, uint64> Roots() override { return m_inner->Roots(); }
+    std::optional<uint64> FindCounter(std::string_view name) override {
+        return m_inner->FindCounter(name);
+    }
     uint64 NextIdentity() override { return m_inner->NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
         if (std::exchange(m_failNext, false)) {
@@ -52,7 +56,10 @@ private:
 // exclusively unless it says otherwise.
 class RuntimeTest : public ::testing::Test {
 protected:
-    void SetUp() override { testing::RegisterTestClasses(); }
+    void SetUp() override {
+        testing::RegisterTestClasses();
+        RegisterOffsetOpsClasses();
+    }
 
     void Open(LockMode mode = LockMode::Exclusive) {
         m_guard.reset();
@@ -132,6 +139,37 @@ TEST_F(RuntimeTest, MarkingQueuesARegisteredObjectOnceAndIgnoresCopies) {
     EXPECT_EQ(m_space->NumDirty(), 1);
 }
 
+// An object that leaves the space (collected by its owner) takes its pending
+// change and its queued deletion with it; its identity, loaded and marked
+// again, is written once.
+TEST_F(RuntimeTest, ObjectsLeavingTheSpaceLeaveTheQueues) {
+    Open();
+    TestNode* a = BuildTree(2);  // 1 (2, 3)
+    m_space->Commit();
+    TestNode* b = a->m_left.Get();
+    b->m_value = 20;
+    b->MarkAsDirtyWithoutTrace();
+    TestNode* c = a->m_right.Get();
+    AsyncPermanentlyDeleteObject(ptr<IPersistable>(c));
+    a->MarkAsDirtyWithoutTrace();
+    for (TestNode* leaving : {b, c}) {
+        ptr<IPersistable>(leaving)->OnGarbageCollect();
+        EXPECT_FALSE(leaving->IsDirty());
+        leaving->Destroy();
+    }
+    a->m_left.Unbind();
+    a->m_right.Unbind();
+    EXPECT_EQ(m_space->NumDirty(), 1);
+    EXPECT_EQ(m_space->NumQueuedDeletions(), 0);
+    EXPECT_EQ(a->m_left->m_value, 2);  // the stored image
+    a->m_left->MarkAsDirtyWithoutTrace();
+    EXPECT_EQ(m_space->DirtyInQueueOrder(), (std::vector<OID>{OID(Seid(1)), OID(Seid(2))}));
+    const int64 written = m_space->Stats().numWritten;
+    m_space->Commit();
+    EXPECT_EQ(m_space->Stats().numWritten - written, 2);
+    EXPECT_EQ(m_store->Stats().numImages, 3);
+}
+
 // Committed objects that refer to each other, all residents dropped, are
 // reached again through the references, from a root kept by name.
 TEST_F(RuntimeTest, DroppedResidentsLoadAgainThroughReferencesWithTheirState) {
@@ -198,9 +236,10 @@ TEST_F(RuntimeTest, ResidentBoundEvictsTheOldestCleanObjectsAfterCommit) {
     EXPECT_EQ(m_space->NumResidents(), 4);
 }
 
-// Deletions queued during an operation are carried out only by a commit that
-// succeeds; a failed commit changes nothing and can be retried.
-TEST_F(RuntimeTest, DeletionHappensOnlyAtASuccessfulCommit) {
+// Deletions queued and counters set during an operation are carried out only
+// by a commit that succeeds; a failed commit changes nothing and can be
+// retried. Counters survive reopening.
+TEST_F(RuntimeTest, DeletionsAndCountersTakeEffectOnlyAtASuccessfulCommit) {
     Open();
     TestNode* root = BuildTree(2);
     m_space->Commit();
@@ -213,8 +252,11 @@ TEST_F(RuntimeTest, DeletionHappensOnlyAtASuccessfulCommit) {
     root->m_value = 10;
     root->MarkAsDirtyWithoutTrace();
     m_space->SetRoot("r", cref<TestNode>(root));
+    m_space->SetCounter("journal", 7);
     m_failing->m_failNext = true;
     EXPECT_THROW(m_space->Commit(), RuntimeError);
+    EXPECT_EQ(m_space->GetCounter("journal"), 7u);  // still pending
+    EXPECT_FALSE(m_store->FindCounter("journal").has_value());
     EXPECT_EQ(m_space->NumQueuedDeletions(), 3);
     EXPECT_TRUE(root->IsDirty());
     EXPECT_EQ(right->m_value, 3);  // alive for the rest of the operation
@@ -227,9 +269,13 @@ TEST_F(RuntimeTest, DeletionHappensOnlyAtASuccessfulCommit) {
     EXPECT_EQ(TestNode::s_live, m_live + 1);
     EXPECT_EQ(m_store->Stats().numImages, 1);  // the new object never reached the store
     EXPECT_EQ(m_store->FindRoot("r"), std::optional<uint64>(1));
+    EXPECT_EQ(m_store->FindCounter("journal"), 7u);
     EXPECT_FALSE(root->m_left.IsBound());  // references to deleted objects are unbound
     EXPECT_THROW(root->m_left.Get(), RuntimeError);
     EXPECT_EQ(root->m_right.TryGet(), nullptr);
+    Open(LockMode::Shared);
+    EXPECT_EQ(m_space->GetCounter("journal"), 7u);
+    EXPECT_FALSE(m_space->GetCounter("journa").has_value());
 }
 
 TEST_F(RuntimeTest, SubTreeDeletionLoadsAndRemovesEverythingBelow) {

@@ -1,42 +1,9 @@
 #include "tnPersistStore/pref.h"
 
-#include "tnRuntime/CSpace.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/xostream.h"
 
 namespace tarn {
-
-ptr<IPersistable> prefbase::Resolve(const ReflectedClass* expected) const {
-    if (m_ptr.m_self != nullptr) {
-        return m_ptr;
-    }
-    if (m_oid.IsNull()) {
-        return ptr<IPersistable>();
-    }
-    CSpace* space = GetThreadCSpace();
-    TARN_ASSERT(space != nullptr);
-    ptr<IPersistable> obj = space->Resolve(m_oid, expected);
-    if (GetRecordedLockStatus(space) > 0) {
-        m_ptr = obj;
-    }
-    return obj;
-}
-
-ptr<IPersistable> prefbase::GetInMemory() const {
-    if (m_ptr.m_self != nullptr || m_oid.IsNull()) {
-        return m_ptr;
-    }
-    CSpace* space = GetThreadCSpace();
-    return space != nullptr ? space->FindResident(m_oid) : ptr<IPersistable>();
-}
-
-void* TryResolvePref(const prefbase& r, const ReflectedClass* expected) {
-    try {
-        return r.Resolve(expected).m_self;
-    } catch (const RuntimeError&) {
-        return nullptr;
-    }
-}
 
 void prefbase::Serialise(Archive& ar, bool) const {
     // An object without identity (never registered) cannot be referred to

@@ -24,6 +24,9 @@
 // kept across eviction or commit; user code keeps identities, root names or
 // a space-tracked SpaceRef (tnRuntime/SpaceRef.h) instead.
 //
+// The operations that reach into the space (Resolve, GetInMemory,
+// TryResolvePref) are the runtime's, defined in tnRuntime/PrefResolution.cpp.
+//
 // Byte image (Serialise / Deserialise; the flag argument is ignored):
 //   identity   8 bytes   m_oid.value_, little-endian; 0 for an empty reference
 // Text form (WriteToStream): "#" and the identity in decimal ("#0" if empty).

@@ -3,10 +3,8 @@
 
 #include "tnRuntime/CSpace.h"
 
-#include <algorithm>
 #include <string>
 
-#include "tnOperation/RegisterClasses.h"
 #include "tnPersistStore/pref.h"
 #include "tnRuntime/ClassRegistry.h"
 #include "tnRuntime/MemoryStore.h"
@@ -38,9 +36,6 @@ void DiscardUnregistered(ptr<IPersistable> obj) {
 
 CSpace::CSpace(std::shared_ptr<IStore> store)
     : m_store(store != nullptr ? std::move(store) : std::make_shared<MemoryStore>()) {
-    // The library's own classes are registered once, before any space can
-    // load or create one of them by name.
-    RegisterOffsetOpsClasses();
     m_nextIdentity = m_store->NextIdentity();
     for (const auto& [name, oid] : m_store->Roots()) {
         if (oid != 0) {
@@ -219,10 +214,13 @@ void CSpace::AdoptNew(ptr<IPersistable> obj) {
     PersistObjState& pstate = obj->GetPersistObjState();
     TARN_ASSERT(state.m_cspace == nullptr && pstate.m_oid.IsNull());
     const OID oid{Seid(m_nextIdentity)};
-    m_dirty.reserve(m_dirty.size() + 1);
-    {
+    m_dirty.push_back(Queued{oid.value_, m_tick});
+    try {
         std::lock_guard<std::mutex> lock(m_residentsMutex);
         m_residents.emplace(oid.value_, Resident{obj, m_tick});
+    } catch (...) {
+        m_dirty.pop_back();
+        throw;
     }
     ++m_nextIdentity;
     pstate.m_oid = oid;
@@ -230,36 +228,46 @@ void CSpace::AdoptNew(ptr<IPersistable> obj) {
     state.m_lastTouchedTime = static_cast<int32>(m_tick++);
     state.SetFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT);
     state.SetFlag(DBP_PO_DIRTY);
-    m_dirty.push_back(obj);
+    ++m_numDirty;
     ++m_stats.numRegistered;
 }
 
 void CSpace::QueueDirty(ptr<IPersistable> obj) {
     RequireExclusive();
-    m_dirty.push_back(obj);
-    obj->GetSysState().SetFlag(DBP_PO_DIRTY);
+    ObjSysState& state = obj->GetSysState();
+    if (state.GetFlag(DBP_PO_DIRTY)) {
+        return;
+    }
+    m_dirty.push_back(EntryOf(obj));
+    state.SetFlag(DBP_PO_DIRTY);
+    ++m_numDirty;
 }
 
 void CSpace::QueueDeletion(ptr<IPersistable> obj, bool subTree) {
     RequireExclusive();
     ObjSysState& state = obj->GetSysState();
-    if (!subTree && state.GetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION)) {
+    const bool queued = state.GetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+    if (queued && !subTree) {
         return;
     }
-    m_deletions.push_back(Deletion{obj, subTree});
-    state.SetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+    m_deletions.push_back(Deletion{EntryOf(obj), subTree});
+    if (!queued) {
+        state.SetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+        ++m_numDeletions;
+    }
 }
 
+// Constant time: the queues' entries are checked at commit.
 void CSpace::Detach(ptr<IPersistable> obj) {
     RequireExclusive();
     ObjSysState& state = obj->GetSysState();
     if (state.GetFlag(DBP_PO_DIRTY)) {
-        std::erase_if(m_dirty, [&](const ptr<IPersistable>& p) { return p.m_self == obj.m_self; });
         state.ClearFlag(DBP_PO_DIRTY);
+        --m_numDirty;
     }
     if (state.GetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION)) {
-        std::erase_if(m_deletions, [&](const Deletion& d) { return d.obj.m_self == obj.m_self; });
         state.ClearFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+        --m_numDeletions;
     }
     {
         std::lock_guard<std::mutex> lock(m_residentsMutex);
@@ -269,6 +277,35 @@ void CSpace::Detach(ptr<IPersistable> obj) {
         }
     }
     state.m_cspace = nullptr;
+}
+
+CSpace::Queued CSpace::EntryOf(ptr<IPersistable> obj) const {
+    const uint64 oid = obj->GetPersistObjState().m_oid.value_;
+    std::lock_guard<std::mutex> lock(m_residentsMutex);
+    auto it = m_residents.find(oid);
+    TARN_ASSERT(it != m_residents.end() && it->second.obj.m_self == obj.m_self);
+    return Queued{oid, it->second.tick};
+}
+
+ptr<IPersistable> CSpace::FlaggedResident(const Queued& entry, int flag) const {
+    std::lock_guard<std::mutex> lock(m_residentsMutex);
+    auto it = m_residents.find(entry.oid);
+    if (it == m_residents.end() || it->second.tick != entry.tick ||
+        !it->second.obj->GetSysState().GetFlag(flag)) {
+        return ptr<IPersistable>();
+    }
+    return it->second.obj;
+}
+
+std::vector<OID> CSpace::DirtyInQueueOrder() const {
+    RequireExclusive();
+    std::vector<OID> order;
+    for (const Queued& entry : m_dirty) {
+        if (FlaggedResident(entry, DBP_PO_DIRTY).m_self != nullptr) {
+            order.push_back(OID(Seid(entry.oid)));
+        }
+    }
+    return order;
 }
 
 void CSpace::SetRoot(const std::string& name, OID oid) {
@@ -297,6 +334,19 @@ std::map<std::string, OID> CSpace::Roots() const {
         roots.emplace(name, OID(Seid(oid)));
     }
     return roots;
+}
+
+void CSpace::SetCounter(const std::string& name, uint64 value) {
+    RequireExclusive();
+    m_pendingCounters[name] = value;
+}
+
+std::optional<uint64> CSpace::GetCounter(std::string_view name) const {
+    auto it = m_pendingCounters.find(name);
+    if (it != m_pendingCounters.end()) {
+        return it->second;
+    }
+    return m_store->FindCounter(name);
 }
 
 void CSpace::AttachExternalRef(SpaceRefLink* link) {

@@ -25,9 +25,12 @@
 // GetReflectedClass()->m_name; the removal of every image queued for
 // permanent deletion (AsyncPermanentlyDeleteSubTree is expanded along
 // VisitPrefs at this point, loading as needed); the changed named roots; the
-// identity counter. Only after the store has accepted the batch are the
-// dirty flags cleared and the deleted objects destroyed; if anything throws
-// before, memory and store are as they were and the commit can be retried.
+// counters set since the last commit (SetCounter); the identity counter. The
+// store receives the writes and the removals each in increasing identity
+// order. Only after the store has accepted the batch are the dirty flags
+// cleared and the deleted objects destroyed; if anything throws before,
+// memory and store are as they were (pending roots and counters stay
+// pending) and the commit can be retried.
 //
 // Eviction (DropCleanResidents, EvictCleanResidents, or the resident bound
 // checked after each commit) releases clean residents, never dirty ones nor
@@ -41,10 +44,20 @@
 // an eviction. To keep an object, keep its identity or a named root and
 // resolve again, or keep a SpaceRef<T> (tnRuntime/SpaceRef.h), a reference
 // that the space tracks and unbinds like its residents' references.
+//
+// Costs. Registering, loading, marking, queueing a deletion and an object
+// leaving the space cost constant time (amortised; hash lookups), whatever
+// the number of residents, dirty objects or queued deletions. A commit costs
+// the sorting of what it writes and removes, plus one walk over all
+// residents when it deletes something (to unbind references to the deleted
+// objects); an eviction round costs one walk over all residents. The space
+// knows no class by itself: classes are registered with the ClassRegistry
+// (tnRuntime/ClassRegistry.h) by whoever opens the space.
 
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <shared_mutex>
 #include <string>
 #include <string_view>
@@ -103,8 +116,16 @@ public:
     bool IsResident(OID oid) const { return FindResident(oid).m_self != nullptr; }
 
     ssize_t NumResidents() const;
-    ssize_t NumDirty() const { return static_cast<ssize_t>(m_dirty.size()); }
-    ssize_t NumQueuedDeletions() const { return static_cast<ssize_t>(m_deletions.size()); }
+    // Objects whose changes the next commit writes.
+    ssize_t NumDirty() const { return m_numDirty; }
+    // Objects queued for permanent deletion (each once, however often and
+    // however queued).
+    ssize_t NumQueuedDeletions() const { return m_numDeletions; }
+    // The identities of the dirty objects in the order they were queued:
+    // by registration, or by their first mark since the last commit. (The
+    // store receives them in identity order; this keeps the order of an
+    // operation's marks observable.) Exclusive.
+    std::vector<OID> DirtyInQueueOrder() const;
     const CSpaceStats& Stats() const { return m_stats; }
     // The identity the next registered object receives.
     uint64 NextIdentity() const { return m_nextIdentity; }
@@ -124,6 +145,16 @@ public:
     // The root's identity, null when there is none.
     OID GetRoot(std::string_view name) const;
     std::map<std::string, OID> Roots() const;
+
+    // --- Named counters -------------------------------------------------------
+
+    // Sets a named 64-bit counter (e.g. the journal position the changes up
+    // to now cover); stored by the next commit, atomically with its images,
+    // and kept pending when that commit throws. Exclusive.
+    void SetCounter(const std::string& name, uint64 value);
+    // The counter's current value: set but not yet committed, else the
+    // store's; nothing when it was never set.
+    std::optional<uint64> GetCounter(std::string_view name) const;
 
     // --- Commit and eviction (exclusive) --------------------------------------
 
@@ -159,14 +190,28 @@ private:
         ptr<IPersistable> obj;
         uint64 tick;  // load or registration order, for eviction
     };
+    // Dirty objects and queued deletions are kept in queue order as the
+    // identity and the tick of the resident they were queued for. An object
+    // that leaves the space (Detach) only has its flags cleared and the
+    // counts lowered: its entries stay behind and are skipped at commit,
+    // where an entry counts only while the resident of its identity is the
+    // one of its tick and carries the flag. No entry points to an object.
+    struct Queued {
+        uint64 oid;
+        uint64 tick;
+    };
     struct Deletion {
-        ptr<IPersistable> obj;
+        Queued queued;
         bool subTree;
     };
     using ObjectSet = std::unordered_set<const void*>;
 
     void RequireExclusive() const;
     ptr<IPersistable> Load(OID oid, const ReflectedClass* expected);
+    // The entry of a resident object of this space.
+    Queued EntryOf(ptr<IPersistable> obj) const;
+    // The resident object of the entry when it carries `flag`, else null.
+    ptr<IPersistable> FlaggedResident(const Queued& entry, int flag) const;
     void ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet);
     void UnbindReferencesTo(const ObjectSet& objects);
     void DestroyDeleted(const std::vector<ptr<IPersistable>>& doomed);
@@ -178,12 +223,15 @@ private:
     std::unordered_map<uint64, Resident> m_residents;
     uint64 m_tick = 0;
 
-    std::vector<ptr<IPersistable>> m_dirty;  // objects whose DBP_PO_DIRTY is set
-    std::vector<Deletion> m_deletions;
+    std::vector<Queued> m_dirty;        // queued by registration or mark (DBP_PO_DIRTY)
+    std::vector<Deletion> m_deletions;  // DBP_PO_MARKED_DURING_ASYNC_DELETION
+    ssize_t m_numDirty = 0;             // objects with DBP_PO_DIRTY
+    ssize_t m_numDeletions = 0;         // objects with DBP_PO_MARKED_DURING_ASYNC_DELETION
 
     uint64 m_nextIdentity = 1;
     std::map<std::string, uint64, std::less<>> m_roots;  // current view, 0 entries removed
     std::map<std::string, uint64> m_changedRoots;        // since the last commit
+    std::map<std::string, uint64, std::less<>> m_pendingCounters;  // since the last commit
 
     ssize_t m_residentBound = 0;
     CSpaceStats m_stats;

@@ -1,6 +1,7 @@
 // Commit: one store transaction with every queued change, then the in-memory
 // consequences (clean flags, destroyed deletions).
 
+#include <algorithm>
 #include <memory>
 
 #include "tnPersistStore/IPrefVisitor.h"
@@ -30,21 +31,26 @@ public:
 
 // The objects that the queued deletions remove: each queued object, and for
 // a subtree deletion everything below it along VisitPrefs (resolved, and so
-// loaded, as needed). Each object once.
+// loaded, as needed). Each object once, in queue order and then depth first.
+// Entries of objects that left the space meanwhile are skipped.
 void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet) {
     std::vector<ptr<IPersistable>> pending;
     for (const Deletion& d : m_deletions) {
-        if (!doomedSet.insert(d.obj.m_self).second) {
+        ptr<IPersistable> queued = FlaggedResident(d.queued, DBP_PO_MARKED_DURING_ASYNC_DELETION);
+        if (queued.m_self == nullptr) {
+            continue;
+        }
+        if (!doomedSet.insert(queued.m_self).second) {
             if (!d.subTree) {
                 continue;
             }
         } else {
-            doomed.push_back(d.obj);
+            doomed.push_back(queued);
         }
         if (!d.subTree) {
             continue;
         }
-        pending.push_back(d.obj);
+        pending.push_back(queued);
         while (!pending.empty()) {
             ptr<IPersistable> obj = pending.back();
             pending.pop_back();
@@ -67,9 +73,9 @@ void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& 
 // Commit, in steps:
 //   1. expand the queued deletions (may load objects);
 //   2. serialise every dirty object that is not being deleted into the
-//      batch, with its class name;
-//   3. add the removals of deleted objects that have an image, the changed
-//      roots and the identity counter;
+//      batch, with its class name, in identity order;
+//   3. add the removals of deleted objects that have an image (in identity
+//      order), the changed roots, the counters set and the identity counter;
 //   4. hand the batch to the store as one transaction;
 //   5. only then: clear the written objects' flags, empty the queues, and
 //      destroy the deleted objects (after unbinding every reference to them).
@@ -81,44 +87,64 @@ void CSpace::Commit() {
     ObjectSet doomedSet;
     ExpandDeletions(doomed, doomedSet);
 
+    // The dirty objects in identity order. Each has one live entry: the
+    // flag is set once per queueing and cleared only by a commit or when the
+    // object leaves the space.
+    std::vector<std::pair<uint64, ptr<IPersistable>>> dirty;
+    dirty.reserve(m_dirty.size());
+    for (const Queued& entry : m_dirty) {
+        ptr<IPersistable> obj = FlaggedResident(entry, DBP_PO_DIRTY);
+        if (obj.m_self != nullptr && doomedSet.count(obj.m_self) == 0) {
+            dirty.emplace_back(entry.oid, obj);
+        }
+    }
+    std::sort(dirty.begin(), dirty.end(),
+              [](const auto& a, const auto& b) { return a.first < b.first; });
+
     CommitBatch batch;
-    std::vector<ptr<IPersistable>> written;
-    batch.writes.reserve(m_dirty.size());
-    written.reserve(m_dirty.size());
+    batch.writes.reserve(dirty.size());
     MemoryOutputStream bytes;
     auto ar = std::make_unique<Archive>(&bytes);
-    for (const ptr<IPersistable>& obj : m_dirty) {
-        if (doomedSet.count(obj.m_self) != 0) {
-            continue;
-        }
+    for (const auto& [oid, obj] : dirty) {
         bytes.clear();
         ar->ClearWriteBufferAndNumBytesWritten();
         obj->Serialise(*ar);
         ar->Flush();
         StoredImage image{obj->GetReflectedClass()->m_name, bytes.bytes()};
-        batch.writes.emplace_back(obj->GetPersistObjState().m_oid.value_, std::move(image));
-        written.push_back(obj);
+        batch.writes.emplace_back(oid, std::move(image));
     }
     for (const ptr<IPersistable>& obj : doomed) {
         if (!obj->GetSysState().GetFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT)) {
             batch.deletes.push_back(obj->GetPersistObjState().m_oid.value_);
         }
     }
+    std::sort(batch.deletes.begin(), batch.deletes.end());
     batch.roots = m_changedRoots;
+    batch.counters.insert(m_pendingCounters.begin(), m_pendingCounters.end());
     batch.nextIdentity = m_nextIdentity;
 
     m_store->Commit(batch);
 
-    for (const ptr<IPersistable>& obj : written) {
+    // Every dirty object was written or is deleted below, and every queued
+    // deletion was expanded: the queues start afresh.
+    for (const auto& [oid, obj] : dirty) {
         ObjSysState& state = obj->GetSysState();
         state.ClearFlag(DBP_PO_DIRTY);
         state.ClearFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT);
     }
+    for (const ptr<IPersistable>& obj : doomed) {
+        ObjSysState& state = obj->GetSysState();
+        state.ClearFlag(DBP_PO_DIRTY);
+        state.ClearFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
+    }
     m_dirty.clear();
     m_deletions.clear();
+    m_numDirty = 0;
+    m_numDeletions = 0;
     m_changedRoots.clear();
+    m_pendingCounters.clear();
     ++m_stats.numCommits;
-    m_stats.numWritten += static_cast<int64>(written.size());
+    m_stats.numWritten += static_cast<int64>(dirty.size());
 
     if (!doomed.empty()) {
         UnbindReferencesTo(doomedSet);
@@ -134,8 +160,6 @@ void CSpace::Commit() {
 void CSpace::DestroyDeleted(const std::vector<ptr<IPersistable>>& doomed) {
     for (const ptr<IPersistable>& obj : doomed) {
         ObjSysState& state = obj->GetSysState();
-        state.ClearFlag(DBP_PO_DIRTY);
-        state.ClearFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
         state.SetFlag(DBP_PO_SYNC_DELETED);
         obj->OnGarbageCollect();
         if (state.m_cspace == this) {

@@ -84,14 +84,21 @@ ssize_t CSpace::EvictCleanResidents(ssize_t maxResidents) {
                 candidates.emplace_back(HasChildren::Of(resident.obj), &resident);
             }
         }
-        std::sort(candidates.begin(), candidates.end(), [](const auto& a, const auto& b) {
+        // Ticks are unique, so the order is total and the chosen victims do
+        // not depend on the residents' hash order. Only the chosen ones are
+        // sorted.
+        const auto before = [](const auto& a, const auto& b) {
             return a.first != b.first ? b.first : a.second->tick < b.second->tick;
-        });
-        for (const auto& [inner, resident] : candidates) {
-            if (static_cast<ssize_t>(clean.size()) == excess) {
-                break;
-            }
-            clean.push_back(resident);
+        };
+        if (static_cast<ssize_t>(candidates.size()) > excess) {
+            std::nth_element(candidates.begin(), candidates.begin() + excess, candidates.end(),
+                             before);
+            candidates.resize(static_cast<std::size_t>(excess));
+        }
+        std::sort(candidates.begin(), candidates.end(), before);
+        clean.reserve(candidates.size());
+        for (const auto& candidate : candidates) {
+            clean.push_back(candidate.second);
         }
     }
     std::vector<ptr<IPersistable>> victims;

@@ -4,7 +4,8 @@
 //
 // A store keeps, per object identity, the object's image: the registered name
 // of its class and the bytes its Serialise slot wrote. It also keeps named
-// roots (name -> identity) and the identity counter. All changes of one
+// roots (name -> identity), named counters (name -> 64-bit value, e.g. the
+// journal position a commit covers) and the identity counter. All changes of one
 // commit are applied by Commit as a single atomic step: after a crash the
 // store holds the previous commit or the new one, never a mix.
 //
@@ -29,11 +30,14 @@ struct StoredImage {
 
 // Everything one commit changes. A store applies the writes, then the
 // deletions (deleting an identity without an image is no error), then the
-// roots and the counter.
+// roots, the named counters and the identity counter. A space hands over its
+// writes and deletions in increasing identity order, each identity once; a
+// store accepts any order.
 struct CommitBatch {
     std::vector<std::pair<uint64, StoredImage>> writes;  // identity -> new image
     std::vector<uint64> deletes;                         // identities to remove
     std::map<std::string, uint64> roots;                 // named roots to set
+    std::map<std::string, uint64> counters;              // named counters to set
     uint64 nextIdentity = 1;                             // the identity counter
 };
 
@@ -50,6 +54,8 @@ public:
     virtual std::optional<StoredImage> Load(uint64 oid) = 0;
     virtual std::optional<uint64> FindRoot(std::string_view name) = 0;
     virtual std::map<std::string, uint64> Roots() = 0;
+    // The named counter's value, or nothing when no commit has set it.
+    virtual std::optional<uint64> FindCounter(std::string_view name) = 0;
     // The next identity to hand out (1 in a new store).
     virtual uint64 NextIdentity() = 0;
     virtual void Commit(const CommitBatch& batch) = 0;

@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <array>
@@ -12,6 +13,7 @@
 #include <cstring>
 #include <filesystem>
 #include <limits>
+#include <set>
 #include <span>
 #include <type_traits>
 #include <utility>
@@ -35,6 +37,7 @@ constexpr const char* kMetaDb = "meta";
 constexpr std::string_view kFormatKey = "format";
 constexpr std::string_view kNextIdentityKey = "next-identity";
 constexpr std::string_view kRootPrefix = "root:";
+constexpr std::string_view kCounterPrefix = "counter:";
 constexpr std::string_view kFormatMagic = "TARNSTOR";
 constexpr uint32 kFormatVersion = 1;
 // ForEachIdentity reads identities in chunks of this many, so that the
@@ -91,11 +94,18 @@ uint64 FromLe64(const MDB_val& val) {
     return value;
 }
 
-std::string RootKey(std::string_view name) {
-    std::string key(kRootPrefix);
+std::string MetaKey(std::string_view prefix, std::string_view name) {
+    std::string key(prefix);
     key += name;
     return key;
 }
+
+// The store directories open in this process, by device and inode. A child
+// made by fork() inherits the set but none of the stores in it (it must not
+// use them, and LMDB's locks are not inherited): it starts with an empty set.
+std::mutex g_openDirsMutex;
+std::set<std::pair<uint64, uint64>> g_openDirs;
+pid_t g_openDirsPid = 0;  // the process the set belongs to
 
 std::string OidText(uint64 oid) {
     return "#" + std::to_string(oid);
@@ -167,12 +177,16 @@ private:
 
 }  // namespace
 
-// A read transaction for the length of one call: the store's reader renewed
-// on entry and reset on exit.
+// A read transaction for the length of one call: a writer's reader renewed
+// on entry and reset on exit, or a reader's snapshot, kept.
 class LmdbStore::ReadScope {
 public:
-    explicit ReadScope(LmdbStore& store) : m_txn(store.BeginRead()) {}
-    ~ReadScope() { mdb_txn_reset(m_txn); }
+    explicit ReadScope(LmdbStore& store) : m_txn(store.BeginRead()), m_keep(store.m_readOnly) {}
+    ~ReadScope() {
+        if (!m_keep) {
+            mdb_txn_reset(m_txn);
+        }
+    }
     ReadScope(const ReadScope&) = delete;
     ReadScope& operator=(const ReadScope&) = delete;
 
@@ -180,6 +194,7 @@ public:
 
 private:
     MDB_txn* m_txn;
+    bool m_keep;
 };
 
 std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir, OpenMode mode) {
@@ -196,6 +211,9 @@ std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir,
     store->LockDirectory();
     store->OpenEnvironment();
     store->OpenDatabases(options.mode);
+    if (store->m_readOnly) {
+        store->BeginSnapshot();
+    }
     return store;
 }
 
@@ -209,19 +227,46 @@ LmdbStore::~LmdbStore() {
     if (m_env != nullptr) {
         mdb_env_close(m_env);
     }
+    if (m_registered) {
+        std::lock_guard<std::mutex> lock(g_openDirsMutex);
+        if (g_openDirsPid == ::getpid()) {
+            g_openDirs.erase(m_dirId);
+        }
+    }
     if (m_dirFd >= 0) {
         ::close(m_dirFd);
     }
 }
 
+// Enters the directory as open in this process (refused when it already
+// is) and, for a writer, takes the exclusive flock.
 void LmdbStore::LockDirectory() {
     m_dirFd = ::open(m_dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (m_dirFd < 0) {
         Fail(std::string("cannot open the directory: ") + std::strerror(errno));
     }
-    if (::flock(m_dirFd, (m_readOnly ? LOCK_SH : LOCK_EX) | LOCK_NB) != 0) {
+    struct stat st;
+    if (::fstat(m_dirFd, &st) != 0) {
+        Fail(std::string("cannot examine the directory: ") + std::strerror(errno));
+    }
+    m_dirId = {static_cast<uint64>(st.st_dev), static_cast<uint64>(st.st_ino)};
+    {
+        std::lock_guard<std::mutex> lock(g_openDirsMutex);
+        if (g_openDirsPid != ::getpid()) {
+            g_openDirs.clear();
+            g_openDirsPid = ::getpid();
+        }
+        if (!g_openDirs.insert(m_dirId).second) {
+            Fail("in use: the store is already open in this process");
+        }
+        m_registered = true;
+    }
+    if (m_readOnly) {
+        return;
+    }
+    if (::flock(m_dirFd, LOCK_EX | LOCK_NB) != 0) {
         if (errno == EWOULDBLOCK) {
-            Fail("in use: another opener (in this or another process) holds the store");
+            Fail("in use: another writer (in this or another process) holds the store");
         }
         Fail(std::string("cannot lock the directory: ") + std::strerror(errno));
     }
@@ -383,7 +428,28 @@ void LmdbStore::GrowMap() {
           "growing the map to " + std::to_string(current * 2) + " bytes");
 }
 
+// A reader's snapshot. The writer may have grown the map since this
+// environment was opened; the map size is adopted from the file first (no
+// transaction of this environment is open yet), and again should the writer
+// grow it in between.
+void LmdbStore::BeginSnapshot() {
+    for (int attempt = 0;; ++attempt) {
+        Check(mdb_env_set_mapsize(m_env, 0), "adopting the map size");
+        const int rc = mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &m_reader);
+        if (rc == MDB_SUCCESS) {
+            return;
+        }
+        m_reader = nullptr;
+        if (rc != MDB_MAP_RESIZED || attempt == 3) {
+            Check(rc, "beginning the read snapshot");
+        }
+    }
+}
+
 MDB_txn* LmdbStore::BeginRead() {
+    if (m_readOnly) {
+        return m_reader;  // the snapshot
+    }
     for (int attempt = 0;; ++attempt) {
         if (m_reader != nullptr) {
             if (mdb_txn_renew(m_reader) == MDB_SUCCESS) {
@@ -405,7 +471,7 @@ MDB_txn* LmdbStore::BeginRead() {
     }
 }
 
-uint64 LmdbStore::ReadMetaIdentity(MDB_txn* txn, std::string_view key, bool* found) {
+uint64 LmdbStore::ReadMeta64(MDB_txn* txn, std::string_view key, bool* found) {
     MDB_val k = Val(key);
     MDB_val value;
     const int rc = mdb_get(txn, m_meta, &k, &value);
@@ -447,7 +513,7 @@ std::optional<uint64> LmdbStore::FindRoot(std::string_view name) {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);
     bool found = false;
-    const uint64 oid = ReadMetaIdentity(read.Txn(), RootKey(name), &found);
+    const uint64 oid = ReadMeta64(read.Txn(), MetaKey(kRootPrefix, name), &found);
     if (!found) {
         return std::nullopt;
     }
@@ -481,11 +547,22 @@ std::map<std::string, uint64> LmdbStore::Roots() {
     return roots;
 }
 
+std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
+    std::lock_guard lock(m_mutex);
+    ReadScope read(*this);
+    bool found = false;
+    const uint64 value = ReadMeta64(read.Txn(), MetaKey(kCounterPrefix, name), &found);
+    if (!found) {
+        return std::nullopt;
+    }
+    return value;
+}
+
 uint64 LmdbStore::NextIdentity() {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);
     bool found = false;
-    const uint64 next = ReadMetaIdentity(read.Txn(), kNextIdentityKey, &found);
+    const uint64 next = ReadMeta64(read.Txn(), kNextIdentityKey, &found);
     if (!found) {
         Fail("damaged store: the identity counter is missing");
     }
@@ -519,8 +596,17 @@ void LmdbStore::Commit(const CommitBatch& batch) {
                 Check(rc, "commit: deleting image " + OidText(oid));
             }
         }
+        for (const auto& [name, value] : batch.counters) {
+            const std::string counterKey = MetaKey(kCounterPrefix, name);
+            const auto bytes = Le64(value);
+            MDB_val key = Val(counterKey);
+            MDB_val val = Val(bytes.data(), bytes.size());
+            if (const int rc = mdb_put(txn, m_meta, &key, &val, 0); rc != 0) {
+                Check(rc, "commit: setting counter '" + name + "'");
+            }
+        }
         for (const auto& [name, oid] : batch.roots) {
-            const std::string rootKey = RootKey(name);
+            const std::string rootKey = MetaKey(kRootPrefix, name);
             const auto bytes = Le64(oid);
             MDB_val key = Val(rootKey);
             MDB_val value = Val(bytes.data(), bytes.size());

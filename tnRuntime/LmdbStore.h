@@ -1,7 +1,7 @@
 #pragma once
 
-// The embedded on-disk store: object images, named roots and the identity
-// counter in one LMDB environment inside a directory.
+// The embedded on-disk store: object images, named roots, named counters and
+// the identity counter in one LMDB environment inside a directory.
 //
 // Directory contents: LMDB's "data.mdb" and "lock.mdb", nothing else. The
 // environment holds two named databases:
@@ -11,6 +11,7 @@
 //   "meta"    "format"        -> "TARNSTOR" + format version, 4 bytes LE (1)
 //             "next-identity" -> the identity counter, 8 bytes LE
 //             "root:<name>"   -> the identity of root <name>, 8 bytes LE
+//             "counter:<name>" -> the value of counter <name>, 8 bytes LE
 // A directory whose environment has no "meta" database with this format
 // marker is not a store and is refused.
 //
@@ -24,11 +25,24 @@
 //   LmdbStoreOptions::initialMapSize (1 GiB: address space only, the file
 //   grows with its contents) and doubles whenever a commit finds the map full;
 //   the commit is then retried, so a caller never sees the limit.
-// - One opener at a time: Open takes a flock on the directory before LMDB
-//   touches it, exclusive for a writable store and shared for ReadOnly. A
-//   second opener, in this or another process, is refused at once with a
-//   RuntimeError ("in use") rather than left waiting. Read-only openers may
-//   share a store with each other, not with a writer.
+// - One writer, any number of readers: Open takes an exclusive flock on the
+//   directory for a writable store before LMDB touches it, so that a second
+//   writer, in this or another process, is refused at once with a
+//   RuntimeError ("in use") rather than left waiting. A ReadOnly store takes
+//   no flock: readers in other processes work beside the writer (LMDB serves
+//   readers beside its one writer). Within one process a store directory is
+//   open at most once, whatever the modes (LMDB's locks are per process; a
+//   second environment on the same files in one process would corrupt
+//   them): a second opener in the same process is refused with "in use".
+//   A child made by fork() may open the store afresh (never use a store it
+//   inherited): it then counts as another process.
+// - Snapshots: a ReadOnly store holds one LMDB read transaction from Open to
+//   its destruction. Every read of it (Load, FindRoot, Roots, FindCounter,
+//   NextIdentity, ForEachIdentity, Stats) sees the commit that was the
+//   latest when it was opened, whatever the writer commits meanwhile; open
+//   it again to see newer commits. While it is open the writer cannot reuse
+//   the pages of that commit, so the file grows faster: keep readers short.
+//   A writable store reads the latest commit at every call.
 // - Threads: every member may be called from any thread; calls are serialised
 //   by an internal mutex. A store must not be used in a child after fork().
 // - Faults: a missing directory (when it must exist), a directory that is not
@@ -43,6 +57,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <utility>
 
 #include "tnRuntime/IStore.h"
 
@@ -54,7 +69,7 @@ namespace tarn {
 enum class OpenMode {
     CreateIfMissing,  // make the directory and an empty store when there is none
     MustExist,        // the directory must already hold a store
-    ReadOnly,         // an existing store, for reading only; Commit asserts
+    ReadOnly,         // an existing store, read as one snapshot beside any writer; Commit asserts
 };
 
 struct LmdbStoreOptions {
@@ -80,6 +95,7 @@ public:
     std::optional<StoredImage> Load(uint64 oid) override;
     std::optional<uint64> FindRoot(std::string_view name) override;
     std::map<std::string, uint64> Roots() override;
+    std::optional<uint64> FindCounter(std::string_view name) override;
     uint64 NextIdentity() override;
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;
@@ -97,12 +113,13 @@ private:
     void LockDirectory();
     void OpenEnvironment();
     void OpenDatabases(OpenMode mode);
+    void BeginSnapshot();
     void CheckFormat(MDB_txn* txn);
     template <class Apply>
     void WriteTransaction(Apply&& apply);
     void GrowMap();
     MDB_txn* BeginRead();
-    uint64 ReadMetaIdentity(MDB_txn* txn, std::string_view key, bool* found);
+    uint64 ReadMeta64(MDB_txn* txn, std::string_view key, bool* found);
 
     [[noreturn]] void Fail(const std::string& what) const;
     void Check(int rc, std::string_view doing) const;
@@ -110,10 +127,14 @@ private:
     std::string m_dir;
     LmdbStoreOptions m_options;
     bool m_readOnly = false;
-    int m_dirFd = -1;  // holds the opener's flock
+    int m_dirFd = -1;                         // holds a writer's flock
+    bool m_registered = false;                // the directory is entered as open in this process
+    std::pair<uint64, uint64> m_dirId{0, 0};  // the directory's device and inode
     MDB_env* m_env = nullptr;
-    MDB_txn* m_reader = nullptr;  // a reset read transaction, renewed per read
-    unsigned int m_images = 0;    // LMDB database handles (MDB_dbi)
+    // A writer's reader: a reset read transaction, renewed per read. A
+    // ReadOnly store's snapshot: one read transaction for its lifetime.
+    MDB_txn* m_reader = nullptr;
+    unsigned int m_images = 0;  // LMDB database handles (MDB_dbi)
     unsigned int m_meta = 0;
     std::mutex m_mutex;
 };

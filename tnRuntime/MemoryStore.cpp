@@ -28,13 +28,23 @@ std::map<std::string, uint64> MemoryStore::Roots() {
     return std::map<std::string, uint64>(m_roots.begin(), m_roots.end());
 }
 
+std::optional<uint64> MemoryStore::FindCounter(std::string_view name) {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    auto it = m_counters.find(name);
+    if (it == m_counters.end()) {
+        return std::nullopt;
+    }
+    return it->second;
+}
+
 uint64 MemoryStore::NextIdentity() {
     std::shared_lock<std::shared_mutex> lock(m_mutex);
     return m_nextIdentity;
 }
 
 void MemoryStore::Commit(const CommitBatch& batch) {
-    // 1. Build everything that allocates: new image nodes and the new roots.
+    // 1. Build everything that allocates: new image nodes, the new roots and
+    //    counters.
     std::vector<std::map<uint64, StoredImage>::node_type> nodes;
     nodes.reserve(batch.writes.size());
     for (const auto& [oid, image] : batch.writes) {
@@ -47,6 +57,13 @@ void MemoryStore::Commit(const CommitBatch& batch) {
     for (const auto& [name, oid] : batch.roots) {
         roots[name] = oid;
     }
+    std::map<std::string, uint64, std::less<>> counters;
+    if (!batch.counters.empty()) {
+        counters = m_counters;
+        for (const auto& [name, value] : batch.counters) {
+            counters[name] = value;
+        }
+    }
     // 2. Apply without allocating: relinking nodes and erasing cannot throw.
     //    Writes go first, then deletions, as in every store: an identity both
     //    written and deleted in one batch ends up without an image.
@@ -58,6 +75,9 @@ void MemoryStore::Commit(const CommitBatch& batch) {
         m_images.erase(oid);
     }
     m_roots.swap(roots);
+    if (!batch.counters.empty()) {
+        m_counters.swap(counters);
+    }
     m_nextIdentity = batch.nextIdentity;
     ++m_numCommits;
 }

@@ -20,6 +20,9 @@ public:
         return m_inner->FindRoot(name);
     }
     std::map<std::string, uint64> Roots() override { return m_inner->Roots(); }
+    std::optional<uint64> FindCounter(std::string_view name) override {
+        return m_inner->FindCounter(name);
+    }
     uint64 NextIdentity() override { return m_inner->NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
         m_inner->Commit(batch);

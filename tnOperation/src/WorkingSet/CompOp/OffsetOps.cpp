@@ -3,7 +3,6 @@
 #include "tnObject/IObjectVisitor.h"
 #include "tnPersistStore/IPrefVisitor.h"
 #include "tnPersistStore/PersistableReflection.h"
-#include "tnRuntime/CSpace.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/xostream.h"
 

@@ -7,7 +7,9 @@ namespace tarn {
 // registry, so that stored images of them can be loaded by class name.
 // Also enters the bounds-checked image check of each class, which the loader
 // runs before a class's reader sees an image from a store. Runs exactly once
-// per process; later calls do nothing. Every object space calls it when it is created.
+// per process; later calls do nothing. The runtime knows no class by itself:
+// whoever opens a space over stored records (the embedding API, a test, a
+// benchmark) calls it before the space loads or creates one of them by name.
 void RegisterOffsetOpsClasses();
 
 }  // namespace tarn

@@ -1,4 +1,4 @@
-#include "tnOperation/RegisterClasses.h"
+#include "tnStore/RegisterClasses.h"
 
 #include <mutex>
 
