@@ -4,11 +4,14 @@
 // a child process, and a model of what a store should hold.
 
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/wait.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <sstream>
 #include <string>
@@ -60,18 +63,25 @@ inline std::string ReadFile(const std::string& path) {
     return text.str();
 }
 
-// Runs offsetops with `args` (none holds a quote), its standard input
-// reading `input`.
-inline ToolRun Tool(const std::vector<std::string>& args, const std::string& input = {}) {
-    ScratchDir io;
+// The shell command that runs offsetops with `args` (none holds a quote),
+// its output into files of `io`.
+inline std::string Command(const std::vector<std::string>& args, const ScratchDir& io) {
     std::string command = OFFSETOPS_PATH;
     for (const std::string& a : args) {
         command += " '" + a + "'";
     }
-    command += " <" + io.Write("in", input) + " >" + io.Sub("out") + " 2>" + io.Sub("err");
-    const int status = std::system(command.c_str());
+    return command + " >" + io.Sub("out") + " 2>" + io.Sub("err");
+}
+
+inline ToolRun Result(int status, const ScratchDir& io) {
     return {WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status),
             ReadFile(io.Sub("out")), ReadFile(io.Sub("err"))};
+}
+
+// Runs offsetops with `args`, its standard input reading `input`.
+inline ToolRun Tool(const std::vector<std::string>& args, const std::string& input = {}) {
+    ScratchDir io;
+    return Result(std::system((Command(args, io) + " <" + io.Write("in", input)).c_str()), io);
 }
 
 // Runs offsetops expecting success, which says nothing on standard error
@@ -81,6 +91,21 @@ inline std::string RunOk(const std::vector<std::string>& args, const std::string
     EXPECT_TRUE(run.status == 0 && run.err.empty())
         << ::testing::PrintToString(args) << ": status " << run.status << ", " << run.err;
     return run.out;
+}
+
+// Runs offsetops with `args`, its standard input a pipe that takes `input`,
+// and calls `beside` once the child has read all of it but what the pipe
+// holds (64 KiB); then ends the input and waits for the child's end.
+inline ToolRun ToolBeside(const std::vector<std::string>& args, const std::string& input,
+                          const std::function<void()>& beside) {
+    ScratchDir io;
+    ::signal(SIGPIPE, SIG_IGN);  // a child that died early fails the write instead
+    FILE* pipe = ::popen(Command(args, io).c_str(), "w");
+    EXPECT_TRUE(pipe != nullptr &&
+                std::fwrite(input.data(), 1, input.size(), pipe) == input.size() &&
+                std::fflush(pipe) == 0);
+    beside();
+    return Result(pipe == nullptr ? -1 : ::pclose(pipe), io);
 }
 
 // What `offsetops show` prints for the store in `dir`.

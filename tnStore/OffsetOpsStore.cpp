@@ -212,6 +212,11 @@ void OpenWriter(OffsetOpsStore::Impl& s) {
 void OpenReader(OffsetOpsStore::Impl& s) {
     const std::string path = JournalPath(s.dir);
     for (int attempt = 1;; ++attempt) {
+        // A store directory is open at most once per process: release the
+        // previous attempt's snapshot before taking the next.
+        s.record.reset();
+        s.space.reset();
+        s.store.reset();
         OpenSpace(s, OpenLmdb(s.dir, s.options));
         const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
         FindOrCreateRecord(s);
@@ -448,8 +453,8 @@ void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset
     Impl& s = *m_impl;
     s.RequireWritable();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.MakeRoom();  // a bound too small for the tree throws before anything changes
     try {
-        s.MakeRoom();
         CheckedRecord(s, opid, field, offset);
     } catch (const RecordRefused&) {
         throw;

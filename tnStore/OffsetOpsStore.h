@@ -41,6 +41,11 @@
 // means fewer tree writes per operation and a longer replay when opening
 // after a crash (about a million operations a second).
 //
+// Damaged trees. Opening checks the stored tree (every node of the kind its
+// level needs, keys in order, counts in bounds, the leaf chain): a writer
+// refuses to open a damaged one, a reader opens it so that Check() and
+// Validate() can report, but refuses Find, the ForEach walks and Dump on it.
+//
 // Failures. Every failure is an exception derived from RuntimeError
 // (tnUtils/RuntimeError.h) whose what() is one line naming the file and what
 // is wrong: a missing, unreadable or damaged store, journal or lock file, a
@@ -191,6 +196,8 @@ public:
     int64 Size();
     bool Empty() { return Size() == 0; }
 
+    // Counts the nodes by walking the tree (within the cache bound); on a
+    // damaged tree the node counts stay 0.
     StoreStatistics Stats();
     StoreCheck Check();
     StoreValidation Validate();

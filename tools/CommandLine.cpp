@@ -3,9 +3,13 @@
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
+#include <charconv>
+#include <map>
 #include <new>
+#include <vector>
 
-#include "tnUtils/RuntimeError.h"
+#include "tnStore/OffsetOpsStore.h"
 #include "tools/Commands.h"
 
 namespace tarn::tool {
@@ -14,114 +18,307 @@ namespace {
 
 constexpr int kUsageStatus = 2;
 
+// The largest values the numeric options take.
+constexpr uint64 kMaxGenerate = 1'000'000'000'000;
+constexpr uint64 kMaxFields = 1'000'000'000;
+constexpr uint64 kMaxSites = 1'000'000;
+constexpr uint64 kMaxCommitEvery = 1'000'000'000;
+constexpr uint64 kMaxCacheNodes = 1'000'000'000;
+constexpr uint64 kMaxJournalMiB = uint64{1} << 20;
+constexpr uint64 kMaxLimit = INT64_MAX;
+
+const char* kCommands = "record, show, dump, validate, stats or clear";
+
 const char* kOpsHelp =
     "operations to record, one a line: site,t,oid,path,offset (site a Guid "
     "8-4-4-4-12, t 0..4294967295, oid decimal, path hex, offset signed decimal; "
     "'#' comments); '-' reads standard input";
 
-int Usage(std::ostream& err, const std::string& message) {
-    err << "offsetops: " << message << " (see 'offsetops --help')\n";
+// Wrong arguments: what is wrong, and whose help says more: the program's
+// (""), a command's (its name), or none.
+struct UsageError {
+    std::string message;
+    std::optional<std::string> help = std::nullopt;
+};
+
+int Usage(std::ostream& err, const UsageError& e) {
+    err << "offsetops: " << e.message;
+    if (e.help) {
+        err << " (see 'offsetops " << *e.help << (e.help->empty() ? "" : " ") << "--help')";
+    }
+    err << '\n';
     return kUsageStatus;
+}
+
+// A number as the user wrote it: plain when it looks like one, quoted when not.
+std::string Given(const std::string& text) {
+    const bool integer = !text.empty() &&
+                         std::all_of(text.begin() + (text[0] == '-' ? 1 : 0), text.end(),
+                                     [](char c) { return c >= '0' && c <= '9'; }) &&
+                         text != "-";
+    return integer ? text : "'" + text + "'";
+}
+
+// A subcommand whose options are all taken as text and checked here, so that
+// every message about them is ours.
+class Command {
+public:
+    Command(CLI::App& app, const char* name, const char* help)
+        : m_name(name), m_app(app.add_subcommand(name, help)) {
+        m_app->allow_extras();
+    }
+
+    void Option(const std::string& name, const std::string& type, const std::string& help) {
+        // One value an occurrence, every occurrence kept (Text refuses a
+        // repeated option).
+        m_app->add_option(name, m_values[name], help)
+            ->allow_extra_args(false)
+            ->expected(1)
+            ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+            ->type_name(type);
+    }
+    void Flag(const std::string& name, const std::string& help) {
+        m_app->add_flag(name, m_flags[name], help);
+    }
+
+    explicit operator bool() const { return static_cast<bool>(*m_app); }
+    const std::string& Name() const { return m_name; }
+    bool Has(const std::string& name) const { return !m_values.at(name).empty(); }
+    bool Flagged(const std::string& name) const { return m_flags.at(name); }
+
+    // Arguments the command does not take.
+    void RefuseExtras() const {
+        const std::vector<std::string> extras = m_app->remaining();
+        if (!extras.empty()) {
+            const std::string& first = extras.front();
+            throw UsageError{(first.size() > 1 && first[0] == '-' ? "unknown option '"
+                                                                  : "unexpected argument '") +
+                                 first + "' for " + m_name,
+                             m_name};
+        }
+    }
+
+    // The option's text, if given (once).
+    std::optional<std::string> Text(const std::string& name) const {
+        const std::vector<std::string>& values = m_values.at(name);
+        if (values.size() > 1) {
+            throw UsageError{name + " is given " + std::to_string(values.size()) +
+                             " times; give it once"};
+        }
+        return values.empty() ? std::nullopt : std::optional(values.front());
+    }
+
+    // The store directory every command needs.
+    std::string Store() const {
+        std::optional<std::string> dir = Text("--store");
+        if (!dir || dir->empty()) {
+            throw UsageError{m_name + " needs --store DIR, the store's directory", m_name};
+        }
+        return *dir;
+    }
+
+    // A whole number in decimal digits, from `min` to `max`; `fallback` when
+    // the option is not given. `allowed` describes the values for the message.
+    uint64 Number(const std::string& name, uint64 min, uint64 max, uint64 fallback,
+                  const std::string& allowed = {}) const {
+        const std::optional<std::string> text = Text(name);
+        if (!text) {
+            return fallback;
+        }
+        uint64 value = 0;
+        const char* end = text->data() + text->size();
+        const bool digits = !text->empty() && std::all_of(text->begin(), text->end(), [](char c) {
+            return c >= '0' && c <= '9';
+        });
+        if (!digits || std::from_chars(text->data(), end, value).ec != std::errc{} || value < min ||
+            value > max) {
+            throw UsageError{name + " must be " +
+                             (allowed.empty() ? "a whole number from " + std::to_string(min) +
+                                                    " to " + std::to_string(max)
+                                              : allowed) +
+                             ", got " + Given(*text)};
+        }
+        return value;
+    }
+
+private:
+    std::string m_name;
+    CLI::App* m_app;
+    std::map<std::string, std::vector<std::string>> m_values;
+    std::map<std::string, bool> m_flags;
+};
+
+// The message of what CLI11 itself still refuses: with every option taken as
+// text, that is an option without its value, or a flag given one.
+UsageError Translate(const CLI::ParseError& e) {
+    const std::string what = e.what();
+    const std::size_t colon = what.find(':');
+    if (dynamic_cast<const CLI::ArgumentMismatch*>(&e) != nullptr && colon != std::string::npos) {
+        return {what.substr(0, colon) + " needs a value"};
+    }
+    // "Could not convert: --no-sync = foo"
+    const std::size_t name = what.find("--"), equals = what.find(" = ");
+    if (dynamic_cast<const CLI::ConversionError*>(&e) != nullptr && name < equals &&
+        equals != std::string::npos) {
+        return {what.substr(name, equals - name) + " is a flag and takes no value"};
+    }
+    return {what, ""};
 }
 
 }  // namespace
 
 int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostream& err) {
     CLI::App app{"Records offset operations into an on-disk store and inspects it.", "offsetops"};
-    app.require_subcommand(1);
+    app.allow_extras();
+    app.require_subcommand(0, 1);
 
-    RecordCommand record;
-    GeneratorSettings generate;
-    bool noSync = false;
-    bool noProgress = false;
-    CLI::App* recordCmd = app.add_subcommand(
-        "record", "record operations from a file or generated ones; creates the store if needed");
-    recordCmd->add_option("--store", record.store, "store directory")->required();
-    CLI::Option* opsOpt = recordCmd->add_option("--ops", record.opsFile, kOpsHelp);
-    CLI::Option* genOpt =
-        recordCmd->add_option("--generate", generate.count, "generate this many operations instead")
-            ->check(CLI::NonNegativeNumber);
-    opsOpt->excludes(genOpt);
-    recordCmd->add_option("--fields", generate.fields, "generated: number of fields")
-        ->check(CLI::PositiveNumber)
-        ->needs(genOpt);
-    recordCmd->add_option("--sites", generate.sites, "generated: number of sites")
-        ->check(CLI::Range(int64{1}, int64{1000000}))
-        ->needs(genOpt);
-    recordCmd->add_option("--seed", generate.seed, "generated: random seed")->needs(genOpt);
-    recordCmd
-        ->add_option("--commit-every", record.settings.commitEvery,
-                     "commit after this many operations (default 10000)")
-        ->check(CLI::PositiveNumber);
-    recordCmd
-        ->add_option("--cache-nodes", record.settings.cacheNodes,
-                     "keep at most this many objects in memory (0: no bound)")
-        ->check(CLI::NonNegativeNumber);
-    recordCmd->add_flag("--no-sync", noSync,
-                        "do not sync commits to disk (scratch stores: a machine crash may lose "
-                        "the latest commits)");
-    recordCmd->add_flag("--no-progress", noProgress, "no progress line on a terminal");
+    Command record(app, "record",
+                   "record operations from a file or generated ones; creates the store if needed");
+    record.Option("--store", "DIR", "store directory");
+    record.Option("--ops", "FILE", kOpsHelp);
+    record.Option("--generate", "N",
+                  "generate N operations instead (0 to " + std::to_string(kMaxGenerate) + ")");
+    record.Option("--fields", "F",
+                  "generated: over F fields (1 to " + std::to_string(kMaxFields) + ", default " +
+                      std::to_string(GeneratorSettings{}.fields) + ")");
+    record.Option("--sites", "S",
+                  "generated: from S sites (1 to " + std::to_string(kMaxSites) + ", default " +
+                      std::to_string(GeneratorSettings{}.sites) + ")");
+    record.Option("--seed", "X",
+                  "generated: random seed (0 to " + std::to_string(UINT64_MAX) + ", default " +
+                      std::to_string(GeneratorSettings{}.seed) + ")");
+    record.Option("--commit-every", "K",
+                  "a durable point after every K operations (1 to " +
+                      std::to_string(kMaxCommitEvery) + ", default " +
+                      std::to_string(kDefaultCommitEvery) + ")");
+    record.Option("--cache-nodes", "C",
+                  "keep at most C tree objects in memory at durable points (0: no bound, the "
+                  "default; at most " +
+                      std::to_string(kMaxCacheNodes) + ")");
+    const uint64 defaultJournalMiB = StoreOptions{}.journalLimitBytes >> 20;
+    record.Option("--journal-limit", "MIB",
+                  "checkpoint once the journal has grown past MIB mebibytes (0: at every durable "
+                  "point; at most " +
+                      std::to_string(kMaxJournalMiB) + ", default " +
+                      std::to_string(defaultJournalMiB) + ")");
+    record.Flag("--no-sync",
+                "do not sync durable points to disk (scratch stores: a machine crash may lose "
+                "the latest ones)");
+    record.Flag("--no-progress", "no progress line on a terminal");
 
-    std::string store;
-    std::string fieldText;
-    CLI::App* showCmd =
-        app.add_subcommand("show", "print one field's table, or every field's in key order");
-    showCmd->add_option("--store", store, "store directory")->required();
-    showCmd->add_option("--field", fieldText, "the field, OID/PATH (e.g. #12/0a0b)");
-    int64 limit = -1;
-    showCmd->add_option("--limit", limit, "print at most this many fields, then how many there are")
-        ->check(CLI::NonNegativeNumber);
-    CLI::App* dumpCmd = app.add_subcommand("dump", "print the map's tree, level by level");
-    CLI::App* validateCmd = app.add_subcommand(
-        "validate", "check the tree and the store; exit status 0 only when all holds");
-    CLI::App* statsCmd = app.add_subcommand("stats", "print counts of the store and the tree");
-    CLI::App* clearCmd = app.add_subcommand("clear", "remove every field's table and commit");
-    for (CLI::App* cmd : {dumpCmd, validateCmd, statsCmd, clearCmd}) {
-        cmd->add_option("--store", store, "store directory")->required();
+    Command show(app, "show", "print one field's table, or every field's in key order");
+    show.Option("--store", "DIR", "store directory");
+    show.Option("--field", "OID/PATH", "only this field (e.g. #12/0a0b)");
+    show.Option("--limit", "N", "print at most N fields, then how many there are");
+    Command dump(app, "dump", "print the map's tree, node by node");
+    Command validate(app, "validate",
+                     "check the tree and the store; exit status 0 only when all holds");
+    Command stats(app, "stats", "print counts of the store, its journal and the tree");
+    Command clear(app, "clear", "remove every field's table");
+    for (Command* cmd : {&dump, &validate, &stats, &clear}) {
+        cmd->Option("--store", "DIR", "store directory");
     }
 
     try {
-        app.parse(argc, argv);
-    } catch (const CLI::ParseError& e) {
-        if (e.get_exit_code() == 0) {
-            return app.exit(e, out, err);  // --help
+        try {
+            app.parse(argc, argv);
+        } catch (const CLI::ParseError& e) {
+            if (e.get_exit_code() == 0) {
+                return app.exit(e, out, err);  // --help
+            }
+            throw Translate(e);
         }
-        return Usage(err, e.what());
+        const std::vector<std::string> extras = app.remaining();
+        if (!extras.empty()) {
+            const std::string& first = extras.front();
+            throw UsageError{first.size() > 1 && first[0] == '-'
+                                 ? "unknown option '" + first + "': options follow the command"
+                                 : "unknown command '" + first + "': use " + kCommands,
+                             ""};
+        }
+        if (app.get_subcommands().empty()) {
+            throw UsageError{std::string("a command is needed: ") + kCommands, ""};
+        }
+        for (const Command* cmd : {&record, &show, &dump, &validate, &stats, &clear}) {
+            if (*cmd) {
+                cmd->RefuseExtras();
+            }
+        }
+    } catch (const UsageError& e) {
+        return Usage(err, e);
     }
 
     try {
-        if (*recordCmd) {
-            if (opsOpt->count() == 0 && genOpt->count() == 0) {
-                return Usage(err, "record needs --ops FILE or --generate N");
+        if (record) {
+            RecordCommand cmd;
+            cmd.store = record.Store();
+            const bool generate = record.Has("--generate");
+            if (generate == record.Has("--ops")) {
+                throw UsageError{generate ? "record takes --ops FILE or --generate N, not both"
+                                          : "record needs --ops FILE or --generate N",
+                                 "record"};
             }
-            if (genOpt->count() != 0) {
-                record.generate = generate;
-            }
-            record.sync = !noSync;
-            record.progress = !noProgress && isatty(STDERR_FILENO) != 0;
-            return RunRecord(record, out, err);
-        }
-        if (*showCmd) {
-            std::optional<FieldId> field;
-            if (!fieldText.empty()) {
-                std::string error;
-                field = ParseFieldId(fieldText, &error);
-                if (!field) {
-                    return Usage(err, error);
+            if (generate) {
+                GeneratorSettings settings;
+                settings.count =
+                    static_cast<int64>(record.Number("--generate", 0, kMaxGenerate, 0));
+                settings.fields = static_cast<int64>(
+                    record.Number("--fields", 1, kMaxFields, static_cast<uint64>(settings.fields)));
+                settings.sites = static_cast<int64>(
+                    record.Number("--sites", 1, kMaxSites, static_cast<uint64>(settings.sites)));
+                settings.seed = record.Number("--seed", 0, UINT64_MAX, settings.seed);
+                cmd.generate = settings;
+            } else {
+                cmd.opsFile = *record.Text("--ops");
+                if (cmd.opsFile.empty()) {
+                    throw UsageError{"--ops needs a file name, or '-' for standard input"};
+                }
+                for (const char* option : {"--fields", "--sites", "--seed"}) {
+                    if (record.Has(option)) {
+                        throw UsageError{std::string(option) +
+                                         " goes with --generate: it shapes generated operations"};
+                    }
                 }
             }
+            cmd.commitEvery = static_cast<int64>(record.Number(
+                "--commit-every", 1, kMaxCommitEvery, static_cast<uint64>(kDefaultCommitEvery)));
+            cmd.cacheObjects = static_cast<ssize_t>(record.Number(
+                "--cache-nodes", 0, kMaxCacheNodes, 0,
+                "0 (no bound) or a whole number up to " + std::to_string(kMaxCacheNodes)));
+            cmd.journalLimitBytes = static_cast<std::size_t>(record.Number(
+                                        "--journal-limit", 0, kMaxJournalMiB, defaultJournalMiB))
+                                    << 20;
+            cmd.sync = !record.Flagged("--no-sync");
+            cmd.progress = !record.Flagged("--no-progress") && isatty(STDERR_FILENO) != 0;
+            return RunRecord(cmd, out, err);
+        }
+        if (show) {
+            const std::string store = show.Store();
+            std::optional<FieldId> field;
+            if (const std::optional<std::string> text = show.Text("--field")) {
+                std::string error;
+                field = ParseFieldId(*text, &error);
+                if (!field) {
+                    throw UsageError{error};
+                }
+            }
+            const int64 limit = show.Has("--limit")
+                                    ? static_cast<int64>(show.Number("--limit", 0, kMaxLimit, 0))
+                                    : -1;
             return RunShow(store, field, limit, out, err);
         }
-        if (*dumpCmd) {
-            return RunDump(store, out, err);
+        if (dump) {
+            return RunDump(dump.Store(), out, err);
         }
-        if (*validateCmd) {
-            return RunValidate(store, out, err);
+        if (validate) {
+            return RunValidate(validate.Store(), out, err);
         }
-        if (*statsCmd) {
-            return RunStats(store, out, err);
+        if (stats) {
+            return RunStats(stats.Store(), out, err);
         }
-        return RunClear(store, out, err);
+        return RunClear(clear.Store(), out, err);
+    } catch (const UsageError& e) {
+        return Usage(err, e);
     } catch (const RuntimeError& e) {
         err << "offsetops: " << e.what() << '\n';
     } catch (const std::bad_alloc&) {

@@ -1,29 +1,23 @@
 #include "tools/Commands.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <iomanip>
 #include <iostream>
-#include <set>
+#include <map>
+#include <sstream>
 
-#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
-#include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/LmdbStore.h"
-#include "tnUtils/RuntimeError.h"
+#include "tnUtils/OstreamOutputStream.h"
 #include "tnUtils/xostream.h"
-#include "tools/CountingStore.h"
-#include "tools/OstreamOutputStream.h"
-#include "tools/Reachability.h"
-#include "tools/TreeWalk.h"
+#include "tools/OpsFile.h"
 
 namespace tarn::tool {
 
 namespace {
 
-using Map = FieldIdToOffsetOpsOnInt64FieldMap;
 using Clock = std::chrono::steady_clock;
 
 int Fail(std::ostream& err, const std::string& message) {
@@ -31,93 +25,50 @@ int Fail(std::ostream& err, const std::string& message) {
     return 1;
 }
 
-// A space over the LMDB store in `dir`, its store wrapped to count writes.
-struct OpenedSpace {
-    CountingStore* store = nullptr;  // owned by the space
-    std::unique_ptr<CSpace> space;
-};
-
-OpenedSpace OpenSpace(const std::string& dir, OpenMode mode, bool sync = true) {
-    LmdbStoreOptions options;
-    options.mode = mode;
-    options.syncOnCommit = sync;
-    auto counting = std::make_shared<CountingStore>(LmdbStore::Open(dir, options));
-    OpenedSpace opened;
-    opened.store = counting.get();
-    opened.space = std::make_unique<CSpace>(counting);
-    return opened;
-}
-
-// The record's identity; an error for a store that holds none.
-OID RecordRoot(CSpace& space, const std::string& dir) {
-    OID oid = space.GetRoot(kRecordRoot);
-    if (oid.IsNull()) {
-        throw RuntimeError("store '" + dir + "' holds no offsets record (root \"" + kRecordRoot +
-                           "\"); record into it first");
-    }
-    return oid;
-}
-
 void Row(std::ostream& out, const char* label, const std::string& value) {
-    out << std::left << std::setw(16) << label << value << '\n';
+    out << std::left << std::setw(22) << label << value << '\n';
 }
 
-std::string NodesText(int64 leaves, int64 internal) {
-    return std::to_string(leaves + internal) + " (" + std::to_string(leaves) + " leaves, " +
-           std::to_string(internal) + " internal)";
+std::string NodesText(const StoreStatistics& stats) {
+    return std::to_string(stats.Nodes()) + " (" + std::to_string(stats.leaves) + " leaves, " +
+           std::to_string(stats.internalNodes) + " internal)";
 }
 
-// Loads, with class checks, the nodes from the root to the leaf whose range
-// holds `key`, so that the map's own lookup then finds them resident and of
-// the kind it assumes. Throws RuntimeError on a damaged path.
-void LoadPathChecked(const Map& map, const FieldId& key) {
-    if (map.m_height < 0) {
-        return;
-    }
-    const prefbase* ref = &map.m_root;
-    for (ssize_t h = map.m_height; h >= 0; --h) {
-        if (!*ref) {
-            throw RuntimeError("damaged tree: a missing node reference at height " +
-                               std::to_string(h));
-        }
-        if (h == 0) {
-            ref->Resolve(&GetReflectedClass<Map::LeafNode>());
-            return;
-        }
-        const auto* node = static_cast<const Map::InternalNode*>(
-            ref->Resolve(&GetReflectedClass<Map::InternalNode>()).m_self);
-        if (node->m_numKeyEntrys < 1) {
-            throw RuntimeError("damaged tree: internal node " + ToString(ref->m_oid) +
-                               " holds no entries");
-        }
-        const ssize_t i = node->FindChildIndexGivenKey(key);
-        ref = i < 0 ? &node->m_ptr : &node->GetEntry(i).m_ptr;
-    }
+OffsetOpsStore OpenReader(const std::string& dir) {
+    StoreOptions options;
+    options.mode = StoreMode::Read;
+    return OffsetOpsStore::Open(dir, options);
 }
 
-// Refuses a tree that the map's own code could not walk safely.
-void RequireSoundTree(const Map& map) {
-    FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
-        FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
+// Refuses a tree that a walk over all of it could not take safely (the store
+// refuses to walk one too; this says so before anything changes).
+void RequireSoundTree(OffsetOpsStore& store) {
+    const StoreCheck check = store.Check();
     if (!check.Ok()) {
-        throw RuntimeError("the stored tree is damaged (" + std::to_string(check.numProblems) +
-                           " problems; the first: " + check.problems.front() +
-                           "); run 'offsetops validate' for all");
+        throw RuntimeError(
+            "the stored tree is damaged (" + std::to_string(check.numProblems) +
+            " problems; the first: " + (check.problems.empty() ? "?" : check.problems.front()) +
+            "); run 'offsetops validate' for all");
     }
+}
+
+std::string CacheTooSmall(ssize_t bound, ssize_t height) {
+    return "--cache-nodes " + std::to_string(bound) + " is too small: a tree of height " +
+           std::to_string(height) + " needs at least " +
+           std::to_string(OffsetOpsStore::MinCacheObjects(height)) + " objects in memory";
 }
 
 // For each site, the largest time stamp any field's table holds.
-std::map<Guid, int64> LastStamps(CSpace& space, OID mapOid, ssize_t bound) {
+std::map<Guid, int64> LastStamps(OffsetOpsStore& store) {
     std::map<Guid, int64> last;
-    WalkTree(space, mapOid, bound, [&](const Map::LeafNode& leaf) {
-        for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
-            for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                auto [it, added] = last.emplace(site, so.t);
-                if (!added && it->second < so.t) {
-                    it->second = so.t;
-                }
+    store.ForEach([&](const FieldId&, const OffsetOpsOnField<int64>& table) {
+        for (const auto& [site, so] : table.m_map.getmap()) {
+            auto [it, added] = last.emplace(site, so.t);
+            if (!added && it->second < so.t) {
+                it->second = so.t;
             }
         }
+        return true;
     });
     return last;
 }
@@ -128,7 +79,7 @@ public:
     Progress(bool enabled, std::ostream& err, int64 total)
         : m_enabled(enabled), m_err(err), m_total(total), m_start(Clock::now()) {}
 
-    void Update(int64 recorded, int64 committed) {
+    void Update(int64 recorded, int64 durable) {
         if (!m_enabled || (recorded & 1023) != 0) {
             return;
         }
@@ -142,7 +93,7 @@ public:
         if (m_total > 0) {
             m_err << "/" << m_total;
         }
-        m_err << " operations, " << committed << " committed, "
+        m_err << " operations, " << durable << " durable, "
               << static_cast<int64>(seconds > 0 ? recorded / seconds : 0) << " ops/s   "
               << std::flush;
         m_shown = true;
@@ -164,32 +115,23 @@ private:
     bool m_shown = false;
 };
 
-// The message for input that stops a run at `where` (FILE:LINE, or the
-// number of a generated operation).
-std::string Stopped(const std::string& where, const std::string& what, int64 committed) {
-    return where + ": " + what + "; stopped there: the " + std::to_string(committed) +
-           " operations of this run before it are committed, nothing from it on";
-}
-
-void Summary(std::ostream& out, Recorder& recorder, CountingStore& store, CSpace& space,
-             ssize_t bound, Clock::time_point start) {
-    const double seconds = std::chrono::duration<double>(Clock::now() - start).count();
-    const int64 fields = recorder.Map().size();
-    TreeShape shape = WalkTree(space, recorder.MapIdentity(), bound, {});
+void Summary(std::ostream& out, const StoreStatistics& stats, int64 recorded, int64 durablePoints,
+             ssize_t bound, double seconds) {
     std::ostringstream rate;
     rate << std::fixed << std::setprecision(0)
-         << (seconds > 0 ? static_cast<double>(recorder.Recorded()) / seconds : 0.0);
+         << (seconds > 0 ? static_cast<double>(recorded) / seconds : 0.0);
     std::ostringstream elapsed;
     elapsed << std::fixed << std::setprecision(3) << seconds;
-    Row(out, "operations", std::to_string(recorder.Recorded()));
-    Row(out, "fields", std::to_string(fields));
-    Row(out, "nodes", NodesText(shape.leaves, shape.internalNodes));
-    Row(out, "height", std::to_string(shape.height));
-    Row(out, "commits", std::to_string(store.Commits()));
-    Row(out, "images written", std::to_string(store.ImagesWritten()));
-    Row(out, "bytes written", std::to_string(store.BytesWritten()));
+    Row(out, "operations", std::to_string(recorded));
+    Row(out, "fields", std::to_string(stats.fields));
+    Row(out, "nodes", NodesText(stats));
+    Row(out, "height", std::to_string(stats.height));
+    Row(out, "durable points", std::to_string(durablePoints));
+    Row(out, "checkpoints", std::to_string(stats.checkpoints));
+    Row(out, "images written", std::to_string(stats.imagesWritten));
+    Row(out, "bytes written", std::to_string(stats.imageBytesWritten));
     Row(out, "peak residents",
-        std::to_string(recorder.PeakResidents()) +
+        std::to_string(stats.peakResidents) +
             (bound > 0 ? " (bound " + std::to_string(bound) + ")" : std::string()));
     Row(out, "seconds", elapsed.str());
     Row(out, "operations/s", rate.str());
@@ -198,8 +140,8 @@ void Summary(std::ostream& out, Recorder& recorder, CountingStore& store, CSpace
 }  // namespace
 
 int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
-    // Open the source before the store, so that a wrong file name creates no
-    // store.
+    // Check the source and the cache bound before opening the store, so that
+    // a run refused for them creates no store.
     std::ifstream file;
     std::istream* in = nullptr;
     std::string sourceName;
@@ -208,6 +150,10 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
             in = &std::cin;
             sourceName = "<stdin>";
         } else {
+            std::error_code ec;
+            if (std::filesystem::is_directory(cmd.opsFile, ec)) {
+                return Fail(err, "ops file '" + cmd.opsFile + "' is a directory");
+            }
             file.open(cmd.opsFile);
             if (!file) {
                 return Fail(err,
@@ -217,182 +163,201 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
             sourceName = cmd.opsFile;
         }
     }
+    const ssize_t bound = cmd.cacheObjects;
+    if (bound > 0 && bound < OffsetOpsStore::MinCacheObjects(0)) {
+        err << "offsetops: " << CacheTooSmall(bound, 0) << '\n';
+        return 2;
+    }
 
-    OpenedSpace opened = OpenSpace(cmd.store, OpenMode::CreateIfMissing, cmd.sync);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Exclusive);
+    StoreOptions options;
+    options.mode = StoreMode::Write;
+    options.sync = cmd.sync;
+    options.cacheObjects = bound;
+    options.journalLimitBytes = cmd.journalLimitBytes;
+    OffsetOpsStore store = OffsetOpsStore::Open(cmd.store, options);
+    for (const std::string& repair : store.Repairs()) {
+        err << "offsetops: " << cmd.store << ": repaired: " << repair << '\n';
+    }
+    if (bound > 0) {
+        const ssize_t height = std::max<ssize_t>(store.Stats().height, 0);
+        if (bound < OffsetOpsStore::MinCacheObjects(height)) {
+            store.Close();
+            err << "offsetops: " << CacheTooSmall(bound, height) << '\n';
+            return 2;
+        }
+    }
+
     const auto start = Clock::now();
     Progress progress(cmd.progress, err, cmd.generate ? cmd.generate->count : 0);
-    Recorder recorder(space, cmd.settings);
-    const ssize_t bound = cmd.settings.cacheNodes;
+    int64 recorded = 0;       // operations of this run recorded
+    int64 durable = 0;        // of those, durable
+    int64 durablePoints = 0;  // reached by this run
+    auto sync = [&] {
+        store.Sync();
+        durable = recorded;
+        ++durablePoints;
+    };
 
-    // Record until the source ends or an input is refused; `where` names the
-    // input that stopped the run.
+    // Record until the source ends or an input is refused; position() names
+    // the input that stopped the run.
     OffsetOperation op;
     std::string error;
-    std::string where;
     std::optional<Generator> generator;
     std::optional<OpsFileReader> reader;
+    bool inOperation = false;  // `op` is taken from the source, not yet recorded
+    bool finishing = false;    // the source is done
     auto position = [&] {
-        return generator ? "generated operation " + std::to_string(generator->Made())
-                         : reader->Name() + ":" + std::to_string(reader->LineNumber());
+        if (finishing) {
+            return std::string("after the last operation");
+        }
+        if (generator) {
+            return "generated operation " +
+                   std::to_string(generator->Made() + (inOperation ? 0 : 1));
+        }
+        if (reader) {
+            return reader->Name() + ":" + std::to_string(reader->LineNumber());
+        }
+        return std::string("before the first operation");
+    };
+    auto record = [&] {
+        inOperation = true;
+        try {
+            store.Record(Opid(op.site, op.t), op.field, op.offset);
+        } catch (const RecordRefused& e) {
+            error = e.what();
+            return false;
+        }
+        if (++recorded - durable >= cmd.commitEvery) {
+            sync();
+        }
+        inOperation = false;
+        progress.Update(recorded, durable);
+        return true;
     };
     try {
         if (cmd.generate) {
-            generator.emplace(*cmd.generate, LastStamps(space, recorder.MapIdentity(), bound));
-            bool refused = false;
-            while (generator->Next(op, error)) {
-                error = recorder.Record(op);
-                if (!error.empty()) {
-                    refused = true;
-                    break;
-                }
-                progress.Update(recorder.Recorded(), recorder.Committed());
+            generator.emplace(*cmd.generate, LastStamps(store));
+            while (generator->Next(op, error) && record()) {
             }
-            // A refused operation was made; running out of time stamps stops
-            // before the next one.
-            where = "generated operation " + std::to_string(generator->Made() + (refused ? 0 : 1));
         } else {
             reader.emplace(*in, sourceName);
-            for (;;) {
-                OpsFileReader::Status status = reader->Next(op, error);
-                if (status == OpsFileReader::Status::End) {
+            for (OpsFileReader::Status status;
+                 (status = reader->Next(op, error)) != OpsFileReader::Status::End;) {
+                if (status == OpsFileReader::Status::Error || !record()) {
                     break;
                 }
-                if (status == OpsFileReader::Status::Operation) {
-                    error = recorder.Record(op);
-                }
-                if (!error.empty()) {
-                    break;
-                }
-                progress.Update(recorder.Recorded(), recorder.Committed());
             }
-            where = position();
         }
-    } catch (const RuntimeError& e) {
-        // An error of the store in the middle of an operation may leave the
-        // tree in memory half changed: nothing more is committed.
-        progress.Finish();
-        const std::string at = generator || reader ? position() : "before the first operation";
-        return Fail(err, at + ": " + e.what() + "; stopped there: the " +
-                             std::to_string(recorder.Committed()) +
-                             " operations of this run committed before it are kept, the " +
-                             std::to_string(recorder.Recorded() - recorder.Committed()) +
-                             " recorded since are not");
-    }
-    if (!error.empty()) {
         // Refused input never reached the tree: keep everything before it.
-        recorder.Commit();
+        const std::string where = position();
+        finishing = true;
+        if (recorded > durable) {
+            sync();
+        }
+        if (!error.empty()) {
+            store.Close();
+            progress.Finish();
+            return Fail(err, where + ": " + error + "; stopped there: the " +
+                                 std::to_string(durable) +
+                                 " operations of this run before it are durable, nothing from "
+                                 "it on");
+        }
+        store.Checkpoint();
+        const StoreStatistics stats = store.Stats();
+        store.Close();
         progress.Finish();
-        return Fail(err, Stopped(where, error, recorder.Committed()));
+        Summary(out, stats, recorded, durablePoints, bound,
+                std::chrono::duration<double>(Clock::now() - start).count());
+        return 0;
+    } catch (const RuntimeError& e) {
+        // The handle is broken: nothing more becomes durable.
+        progress.Finish();
+        std::string what = e.what();
+        if (bound > 0) {
+            // The store refuses to go on when the tree outgrows the bound;
+            // say so in terms of the option.
+            try {
+                const ssize_t height = store.Stats().height;
+                if (bound < OffsetOpsStore::MinCacheObjects(height)) {
+                    what = CacheTooSmall(bound, height) + ", and the tree has grown to that height";
+                }
+            } catch (const RuntimeError&) {
+            }
+        }
+        return Fail(err, position() + ": " + what +
+                             "; stopped there: the store keeps its last durable point, with the " +
+                             std::to_string(durable) + " operations of this run before it; the " +
+                             std::to_string(recorded - durable) + " recorded since are lost");
     }
-    recorder.Commit();
-    progress.Finish();
-    Summary(out, recorder, *opened.store, space, bound, start);
-    return 0;
 }
 
 int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
             std::ostream& out, std::ostream& err) {
-    OpenedSpace opened = OpenSpace(store, OpenMode::ReadOnly);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Shared);
-    SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
-    const Map& map = *record->m_map;
+    OffsetOpsStore opened = OpenReader(store);
     OstreamOutputStream sink(out);
     xostream os(sink);
     if (field) {
-        LoadPathChecked(map, *field);
-        const OffsetOpsOnField<int64>* table = map.rFind(*field);
-        if (table == nullptr) {
+        const std::optional<OffsetOpsOnField<int64>> table = opened.Find(*field);
+        if (!table) {
             return Fail(err, "no offsets recorded for field " + ToString(*field));
         }
         os << *field << " --> " << *table << '\n';
         return 0;
     }
-    RequireSoundTree(map);
     int64 shown = 0;
-    for (auto it = map.begin(); it != map.end() && shown != limit; ++it, ++shown) {
-        os << it->first << " --> " << it->second << '\n';
-    }
-    if (shown < map.size()) {
-        os << "(" << shown << " of " << map.size() << " fields shown)\n";
+    opened.ForEach([&](const FieldId& key, const OffsetOpsOnField<int64>& table) {
+        if (shown == limit || !out) {
+            return false;
+        }
+        os << key << " --> " << table << '\n';
+        ++shown;
+        return true;
+    });
+    const int64 size = opened.Size();
+    if (shown < size && out) {
+        os << "(" << shown << " of " << size << " fields shown)\n";
     }
     return 0;
 }
 
 int RunDump(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    OpenedSpace opened = OpenSpace(store, OpenMode::ReadOnly);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Shared);
-    SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
-    const Map& map = *record->m_map;
-    RequireSoundTree(map);
-    OstreamOutputStream sink(out);
-    xostream os(sink);
-    map.Write(os);
+    OffsetOpsStore opened = OpenReader(store);
+    opened.Dump(out);
     return 0;
 }
 
 int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) {
-    OpenedSpace opened = OpenSpace(store, OpenMode::ReadOnly);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Shared);
-    const OID recordOid = RecordRoot(space, store);
-    std::vector<std::string> problems;
-    int64 numProblems = 0;
-    try {
-        SpaceRef<OffsetOps> record(space, recordOid);
-        const Map& map = *record->m_map;
-        Row(out, "record", ToString(recordOid) + " (map " + ToString(record->m_map.m_oid) + ")");
-        Row(out, "fields", std::to_string(map.size()));
-        Row(out, "height", std::to_string(map.m_height));
-        FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
-            FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
-        Row(out, "nodes", NodesText(check.leaves, check.internalNodes));
-        problems = check.problems;
-        numProblems = check.numProblems;
-        if (check.Ok()) {
-            // The tree's own checker; it stops the process on a broken
-            // invariant, so it only runs on a tree that passed the checks above.
-            map.Validate();
-            const ssize_t counted = map.GetNumNodes();
-            if (counted != check.Nodes()) {
-                problems.push_back("the map counts " + std::to_string(counted) +
-                                   " nodes, the walk found " + std::to_string(check.Nodes()));
-                ++numProblems;
-            }
-        }
-    } catch (const RuntimeError& e) {
-        problems.push_back(std::string("the record cannot be read: ") + e.what());
-        ++numProblems;
+    OffsetOpsStore opened = OpenReader(store);
+    const StoreValidation v = opened.Validate();
+    std::vector<std::string> problems = v.check.problems;
+    int64 numProblems = v.check.numProblems;
+    if (numProblems > static_cast<int64>(problems.size())) {
+        problems.push_back(
+            "(and " + std::to_string(numProblems - static_cast<int64>(problems.size())) + " more)");
     }
-    ReachabilityResult reach = FindUnreachableImages(space);
-    Row(out, "images",
-        std::to_string(reach.stored) + " (" + std::to_string(reach.reached) +
-            " reached from roots)");
-    // Objects the tree check could not load are reported once.
-    for (const std::string& e : reach.errors) {
-        if (std::none_of(problems.begin(), problems.end(),
-                         [&](const std::string& p) { return p.find(e) != std::string::npos; })) {
-            problems.push_back(e);
+    Row(out, "record", ToString(v.record) + " (map " + ToString(v.map) + ")");
+    if (v.check.Ok()) {
+        const StoreStatistics stats = opened.Stats();
+        Row(out, "fields", std::to_string(stats.fields));
+        Row(out, "height", std::to_string(stats.height));
+        Row(out, "nodes", NodesText(stats));
+        if (!v.mapValid) {
+            problems.push_back("the map's own validation failed");
             ++numProblems;
         }
     }
-    if (!reach.unreachable.empty()) {
+    Row(out, "images",
+        std::to_string(v.images) + " (" + std::to_string(v.reached) + " reached from roots)");
+    if (!v.unreachable.empty()) {
         std::string list;
-        for (std::size_t i = 0; i < reach.unreachable.size() && i < 10; ++i) {
-            list += (i == 0 ? "#" : ", #") + std::to_string(reach.unreachable[i]);
+        for (std::size_t i = 0; i < v.unreachable.size() && i < 10; ++i) {
+            list += (i == 0 ? "#" : ", #") + std::to_string(v.unreachable[i]);
         }
-        if (reach.unreachable.size() > 10) {
+        if (v.unreachable.size() > 10) {
             list += ", ...";
         }
-        problems.push_back(std::to_string(reach.unreachable.size()) +
-                           " images that no root reaches" +
-                           (reach.errors.empty() ? ""
-                                                 : " (or that lie below objects that could not "
-                                                   "be read)") +
-                           ": " + list);
+        problems.push_back(std::to_string(v.unreachable.size()) +
+                           " images that no root reaches: " + list);
         ++numProblems;
     }
     for (const std::string& p : problems) {
@@ -408,53 +373,33 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
 }
 
 int RunStats(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    OpenedSpace opened = OpenSpace(store, OpenMode::ReadOnly);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Shared);
-    const StoreStats stats = space.GetStore().Stats();
-    std::string roots;
-    for (const auto& [name, oid] : space.Roots()) {
-        roots += (roots.empty() ? "" : " ") + name + "=" + ToString(oid);
-    }
-    SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
-    const OID mapOid = record->m_map.m_oid;
-    std::set<Guid> sites;
-    int64 siteRecords = 0;
-    TreeShape shape = WalkTree(space, mapOid, 0, [&](const Map::LeafNode& leaf) {
-        for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
-            for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                sites.insert(site);
-                ++siteRecords;
-            }
-        }
-    });
-    Row(out, "images", std::to_string(stats.numImages));
-    Row(out, "image bytes", std::to_string(stats.numImageBytes));
-    Row(out, "next identity", std::to_string(space.NextIdentity()));
-    Row(out, "roots", roots);
-    Row(out, "fields", std::to_string(shape.entries));
-    Row(out, "sites", std::to_string(sites.size()));
-    Row(out, "site records", std::to_string(siteRecords));
-    Row(out, "height", std::to_string(shape.height));
-    Row(out, "nodes", NodesText(shape.leaves, shape.internalNodes));
-    Row(out, "residents", std::to_string(space.NumResidents()));
+    OffsetOpsStore opened = OpenReader(store);
+    RequireSoundTree(opened);  // the counts of a damaged tree mean little
+    const StoreStatistics stats = opened.Stats();
+    Row(out, "images", std::to_string(stats.images));
+    Row(out, "image bytes", std::to_string(stats.imageBytes));
+    Row(out, "fields", std::to_string(stats.fields));
+    Row(out, "nodes", NodesText(stats));
+    Row(out, "height", std::to_string(stats.height));
+    Row(out, "journal bytes", std::to_string(stats.journalBytes));
+    Row(out, "ops since checkpoint",
+        std::to_string(stats.durableOperations - stats.checkpointedOperations));
     return 0;
 }
 
 int RunClear(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    OpenedSpace opened = OpenSpace(store, OpenMode::MustExist);
-    CSpace& space = *opened.space;
-    CSpaceGuard guard(space, LockMode::Exclusive);
-    SpaceRef<OffsetOps> record(space, RecordRoot(space, store));
+    StoreOptions options;
+    options.mode = StoreMode::WriteExisting;
+    OffsetOpsStore opened = OffsetOpsStore::Open(store, options);
     // Clearing hands the whole tree to deletion, which walks it: refuse a
-    // damaged tree before the map's code takes its nodes for what their
-    // level says they are.
-    RequireSoundTree(*record->m_map);
-    const int64 fields = record->m_map->size();
-    const ssize_t imagesBefore = space.GetStore().Stats().numImages;
-    record->Clear();
-    space.Commit();
-    const ssize_t imagesAfter = space.GetStore().Stats().numImages;
+    // damaged tree first.
+    RequireSoundTree(opened);
+    const int64 fields = opened.Size();
+    const int64 imagesBefore = opened.Stats().images;
+    opened.Clear();
+    opened.Checkpoint();
+    const int64 imagesAfter = opened.Stats().images;
+    opened.Close();
     out << "cleared " << fields << " fields; " << (imagesBefore - imagesAfter)
         << " images removed\n";
     return 0;

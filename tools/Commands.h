@@ -1,41 +1,51 @@
 #pragma once
 
-// The subcommands of `offsetops`, callable in-process (tests call them
-// directly; tools/CommandLine.cpp parses arguments into these structures).
+// The subcommands of `offsetops`, callable in-process (tools/CommandLine.cpp
+// parses arguments into these structures). Each works through the store's
+// API (tnStore/OffsetOpsStore.h) and nothing else of the runtime.
 //
 // Each command writes its results to `out`, its messages to `err`, and returns
 // the process's exit status: 0 on success, 1 when the command failed (bad
-// input, a damaged or missing store, a failed validation). Errors the store or
-// the runtime raise (RuntimeError) propagate to the caller, which reports them.
+// input, a damaged or missing store, a failed validation), 2 for an argument
+// that the store at hand cannot take. Errors of the store (RuntimeError)
+// propagate to the caller, which reports them, unless a command says
+// otherwise.
 //
-// Stores: `record` creates the store directory on first use; every other
-// command needs an existing store and never creates one. The read commands
-// (show, dump, validate, stats) open the store read-only.
+// Stores: `record` is the writer and creates the store on first use; `clear`
+// is the writer of an existing store; the read commands (show, dump,
+// validate, stats) open the store as a reader, beside any writer.
 
+#include <cstddef>
 #include <optional>
 #include <ostream>
 #include <string>
 
+#include "tnStore/OffsetOpsStore.h"
 #include "tools/Generator.h"
-#include "tools/Recorder.h"
 
 namespace tarn::tool {
+
+inline constexpr int64 kDefaultCommitEvery = 10000;
 
 struct RecordCommand {
     std::string store;
     std::string opsFile;                        // "-" is standard input
     std::optional<GeneratorSettings> generate;  // instead of opsFile
-    RecordSettings settings;
-    bool sync = true;       // sync each commit to disk
+    int64 commitEvery = kDefaultCommitEvery;    // a durable point after this many, >= 1
+    ssize_t cacheObjects = 0;                   // 0: no bound
+    std::size_t journalLimitBytes = StoreOptions{}.journalLimitBytes;
+    bool sync = true;       // sync each durable point to disk
     bool progress = false;  // progress lines on `err`
 };
 
-// Records the operations in order. On a malformed line or a refused
-// operation, everything before that line is committed, nothing from it on,
-// and the message names the file, the line and how many operations of this
-// run are committed. An error of the store while recording commits nothing
-// more (the operation it interrupted may have half changed the tree in
-// memory); its message says how many operations the last commit kept. Ends
+// Records the operations in order, with a durable point every `commitEvery`
+// of them, and closes the store (a durable point and a checkpoint). On a
+// malformed line or a refused operation, everything before it is made
+// durable, nothing from it on, and the message names the file, the line and
+// how many operations of this run are durable. An error of the store while
+// recording ends the run at once (status 1); the store keeps its last durable
+// point, and the message says how many operations of this run that holds.
+// A cache bound below what the tree needs is refused with status 2. Ends
 // with a summary on `out`.
 int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err);
 
@@ -46,18 +56,17 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err);
 int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
             std::ostream& out, std::ostream& err);
 
-// The map's dump (FieldIdToOffsetOpsOnInt64FieldMap::Write), after a check
-// that the tree can be walked safely.
+// The tree, node by node.
 int RunDump(const std::string& store, std::ostream& out, std::ostream& err);
 
-// The tree's invariants, the map's own Validate, and the images no root
+// The tree's invariants, the map's own validation, and the images no root
 // reaches. Status 0 only when all hold.
 int RunValidate(const std::string& store, std::ostream& out, std::ostream& err);
 
-// Counts of the store and the tree.
+// Counts of the store, its journal and the tree.
 int RunStats(const std::string& store, std::ostream& out, std::ostream& err);
 
-// Removes every field's table and commits.
+// Removes every field's table and closes the store (a checkpoint).
 int RunClear(const std::string& store, std::ostream& out, std::ostream& err);
 
 }  // namespace tarn::tool

@@ -10,6 +10,9 @@ namespace tarn::tool {
 
 namespace {
 
+// The UTF-8 encoding of U+FEFF, which some editors put at the start of a file.
+constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+
 std::string_view Trim(std::string_view s) {
     const char* blanks = " \t\r";
     std::size_t first = s.find_first_not_of(blanks);
@@ -199,7 +202,11 @@ std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error) {
 OpsFileReader::Status OpsFileReader::Next(OffsetOperation& op, std::string& error) {
     while (std::getline(m_in, m_buffer)) {
         ++m_line;
-        ParsedLine parsed = ParseOpsLine(m_buffer);
+        std::string_view line = m_buffer;
+        if (m_line == 1 && line.starts_with(kByteOrderMark)) {
+            line.remove_prefix(kByteOrderMark.size());
+        }
+        ParsedLine parsed = ParseOpsLine(line);
         switch (parsed.kind) {
             case ParsedLine::Kind::Nothing:
                 continue;

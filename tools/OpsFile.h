@@ -13,11 +13,12 @@
 //   offset  the offset, signed decimal, 64 bits
 //
 // Spaces and tabs around a field are ignored, and so is a carriage return at
-// the end of a line. A '#' starts a comment that runs to the end of the line;
-// a line holding nothing but a comment or blanks is skipped.
+// the end of a line (CRLF files). A UTF-8 byte order mark (EF BB BF) at the
+// start of the first line is skipped. A '#' starts a comment that runs to the
+// end of the line; a line holding nothing but a comment or blanks is skipped.
 //
 // Everything here only parses: nothing checks an operation against what a
-// store already holds (tools/Recorder.h does that).
+// store already holds (OffsetOpsStore::Record refuses what it must not take).
 
 #include <istream>
 #include <optional>
@@ -25,14 +26,11 @@
 #include <string_view>
 
 #include "tnOperation/FieldId.h"
+#include "tnStore/OffsetOpsStore.h"
 #include "tnUtils/Guid.h"
 #include "tnUtils/Types.h"
 
 namespace tarn::tool {
-
-// The largest time stamp an image can hold: time stamps are written as
-// variable-length integers that carry 32 bits.
-constexpr int64 kMaxTimeStamp = 4294967295;
 
 // One offset operation: `offset` added to field `field` by site `site` at
 // time stamp `t`.
