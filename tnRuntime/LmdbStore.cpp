@@ -22,6 +22,7 @@
 #include <lmdb.h>
 
 #include "tnRuntime/ImageRecord.h"
+#include "tnRuntime/LmdbFileCheck.h"
 #include "tnUtils/Assert.h"
 
 namespace tarn {
@@ -209,6 +210,12 @@ std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir,
     std::unique_ptr<LmdbStore> store(new LmdbStore(dir, options));
     // The lock comes first: LMDB must not touch a store another opener uses.
     store->LockDirectory();
+    // LMDB maps the files it is given: a short or damaged one is caught first.
+    const bool writer = options.mode != OpenMode::ReadOnly;
+    CheckLmdbDataFile(dir, writer);
+    if (std::optional<std::string> repair = CheckLmdbLockFile(dir, writer)) {
+        store->m_repairs.push_back(std::move(*repair));
+    }
     store->OpenEnvironment();
     store->OpenDatabases(options.mode);
     if (store->m_readOnly) {
@@ -699,7 +706,7 @@ void LmdbStore::Check(int rc, std::string_view doing) const {
     if (rc == MDB_MAP_FULL) {
         throw MapFull{};
     }
-    Fail(std::string(doing) + ": " + mdb_strerror(rc));
+    Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)));
 }
 
 std::unique_ptr<IStore> OpenStore(const std::string& dir, OpenMode mode) {

@@ -48,16 +48,22 @@
 // - Faults: a missing directory (when it must exist), a directory that is not
 //   a store, a foreign or damaged file, permission problems and damaged
 //   records are all reported as RuntimeError naming the directory and, for a
-//   record, the identity. The record frame guards the image bytes; LMDB's own
-//   page structure is LMDB's to check, and the damage it detects
-//   (MDB_CORRUPTED) arrives as a RuntimeError too. Misuse by the caller
-//   (writing identity 0, committing to a read-only store) asserts.
+//   record, the identity. The record frame guards the image bytes. LMDB
+//   trusts its own pages, so before it maps the files (tnRuntime/
+//   LmdbFileCheck.h) data.mdb is checked against its meta pages (a short file
+//   would fault when touched) and its branch and leaf pages are walked, and
+//   lock.mdb's header is checked: a damaged lock file nobody uses is made
+//   anew and reported in Repairs(). Damage LMDB detects itself
+//   (MDB_CORRUPTED) arrives as a RuntimeError too. A write failed for a full
+//   disk says "no space left on device". Misuse by the caller (writing
+//   identity 0, committing to a read-only store) asserts.
 
 #include <cstddef>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <utility>
+#include <vector>
 
 #include "tnRuntime/IStore.h"
 
@@ -102,6 +108,8 @@ public:
     StoreStats Stats() override;
 
     const std::string& Directory() const { return m_dir; }
+    // What opening repaired (a lock file made anew), one line each.
+    const std::vector<std::string>& Repairs() const { return m_repairs; }
     // The current upper bound of the data file; grows as commits need it.
     std::size_t MapSize();
 
@@ -136,6 +144,7 @@ private:
     MDB_txn* m_reader = nullptr;
     unsigned int m_images = 0;  // LMDB database handles (MDB_dbi)
     unsigned int m_meta = 0;
+    std::vector<std::string> m_repairs;
     std::mutex m_mutex;
 };
 

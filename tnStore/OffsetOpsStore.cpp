@@ -129,13 +129,18 @@ void CheckStoredTree(OffsetOpsStore::Impl& s) {
     }
 }
 
-std::unique_ptr<LmdbStore> OpenLmdb(const std::string& dir, const StoreOptions& options) {
+std::unique_ptr<LmdbStore> OpenLmdb(OffsetOpsStore::Impl& s) {
+    const std::string& dir = s.dir;
+    const StoreOptions& options = s.options;
     LmdbStoreOptions lmdb;
     lmdb.mode = options.mode == StoreMode::Read            ? OpenMode::ReadOnly
                 : options.mode == StoreMode::WriteExisting ? OpenMode::MustExist
                                                            : OpenMode::CreateIfMissing;
     lmdb.syncOnCommit = options.sync;
-    return LmdbStore::Open(dir, lmdb);
+    std::unique_ptr<LmdbStore> store = LmdbStore::Open(dir, lmdb);
+    // What opening the environment repaired (a lock file made anew).
+    s.repairs.insert(s.repairs.end(), store->Repairs().begin(), store->Repairs().end());
+    return store;
 }
 
 void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
@@ -144,6 +149,22 @@ void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
     s.store = std::make_shared<CountingStore>(std::move(store));
     s.space = std::make_unique<CSpace>(s.store);
     s.checkpointed = s.space->GetCounter(kJournalPositionCounter).value_or(0);
+}
+
+// A checkpoint at operation P starts a new journal whose first entry is P; a
+// writer that died between the two left the old journal, which ends at P (the
+// next writer begins the new one when it opens). The stored position has no
+// checksum of its own: any other value is damage, and replaying from it would
+// drop or repeat operations.
+void RequireCheckpointInJournal(const OffsetOpsStore::Impl& s, const std::string& path,
+                                const JournalScan& scan) {
+    if (s.checkpointed != scan.base && s.checkpointed != scan.end) {
+        throw RuntimeError("store '" + s.dir + "': its last checkpoint is recorded at operation " +
+                           std::to_string(s.checkpointed) + ", but journal '" + path +
+                           "' holds operations " + std::to_string(scan.base) + " to " +
+                           std::to_string(scan.end) +
+                           ": the recorded position or the journal is damaged");
+    }
 }
 
 // Writer: the journal after the last checkpoint, replayed; a torn tail cut.
@@ -173,6 +194,11 @@ void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
                            std::to_string(scan.base) + " but the store's last checkpoint covers " +
                            std::to_string(s.checkpointed) + ": the operations between are lost");
     }
+    // Without syncs a machine crash may leave the journal behind the
+    // checkpoint, which the repair below answers.
+    if (s.options.sync || scan.end >= s.checkpointed) {
+        RequireCheckpointInJournal(s, path, scan);
+    }
     if (scan.tornTail()) {
         s.repairs.push_back("dropped " + std::to_string(scan.fileBytes - scan.validBytes) +
                             " bytes of an incomplete last record from journal '" + path +
@@ -180,22 +206,41 @@ void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
     }
     s.journal = std::make_unique<Journal>(s.dir, scan, s.options.sync);
     s.durable = std::max(scan.end, s.checkpointed);
-    if (scan.end < s.checkpointed) {
-        // The journal lost entries the checkpoint already holds: start anew.
+    if (scan.base != s.checkpointed) {
+        // The last checkpoint was cut short before its new journal began (or,
+        // without syncs, the journal lost entries the checkpoint holds): the
+        // checkpoint holds every entry of this one, begin the new one now.
         Journal::Reset(s.dir, s.checkpointed, s.options.sync);
         s.journal =
             std::make_unique<Journal>(s.dir,
                                       JournalScan{s.checkpointed, s.checkpointed,
                                                   Journal::kHeaderBytes, Journal::kHeaderBytes},
                                       s.options.sync);
-        s.repairs.push_back("journal '" + path +
-                            "' ended before the last checkpoint; started a "
-                            "new one after it");
+        if (scan.end < s.checkpointed) {
+            s.repairs.push_back("journal '" + path +
+                                "' ended before the last checkpoint; started a "
+                                "new one after it");
+        }
+    }
+}
+
+// The identity counter has no checksum: one not above a stored identity
+// would hand that identity out again, and a checkpoint would write over its
+// image.
+void RequireIdentitiesAhead(OffsetOpsStore::Impl& s) {
+    const uint64 next = s.store->NextIdentity();
+    uint64 largest = 0;
+    s.store->ForEachIdentity([&](uint64 oid) { largest = std::max(largest, oid); });
+    if (largest >= next) {
+        throw RuntimeError("store '" + s.dir + "' is damaged: its identity counter " +
+                           std::to_string(next) + " is not above the stored identity #" +
+                           std::to_string(largest));
     }
 }
 
 void OpenWriter(OffsetOpsStore::Impl& s) {
-    OpenSpace(s, OpenLmdb(s.dir, s.options));
+    OpenSpace(s, OpenLmdb(s));
+    RequireIdentitiesAhead(s);
     // A store made before journals has neither journal nor position counter.
     const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
     const bool fresh = s.space->GetRoot(kRecordRoot).IsNull();
@@ -217,7 +262,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
         s.record.reset();
         s.space.reset();
         s.store.reset();
-        OpenSpace(s, OpenLmdb(s.dir, s.options));
+        OpenSpace(s, OpenLmdb(s));
         const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
         FindOrCreateRecord(s);
         CheckStoredTree(s);
@@ -250,6 +295,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
             if (scan.base > s.checkpointed) {
                 throw SnapshotTooOld{};
             }
+            RequireCheckpointInJournal(s, path, scan);
             s.durable = std::max(scan.end, s.checkpointed);
             s.journalBytes = scan.validBytes;
             return;
