@@ -19,6 +19,7 @@
 #include <map>
 #include <random>
 
+#include "tests/StoreTables.h"
 #include "tnStore/OffsetOpsStore.h"
 
 namespace tarn {
@@ -55,8 +56,6 @@ Op OpAt(int64 i) {
             i * 31 % 2001 - 1000};
 }
 
-using Tables = std::map<FieldId, std::map<Guid, std::pair<int64, int64>>>;
-
 Tables Model(int64 n) {
     Tables model;
     for (int64 i = 0; i < n; ++i) {
@@ -66,17 +65,6 @@ Tables Model(int64 n) {
         so.second += op.offset;
     }
     return model;
-}
-
-Tables Stored(OffsetOpsStore& store) {
-    Tables tables;
-    store.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
-        for (const auto& [site, so] : table.m_map.getmap()) {
-            tables[field][site] = {so.t, so.o};
-        }
-        return true;
-    });
-    return tables;
 }
 
 // The child: opens the store (replaying its journal), then records the
@@ -154,7 +142,7 @@ TEST(CrashTest, KilledWriterKeepsExactlyADurablePoint) {
         const auto n = static_cast<int64>(store.Stats().durableOperations);
         ASSERT_EQ(n % kK, 0) << "round " << rounds;
         ASSERT_GE(n, reported) << "round " << rounds << ": a durable point was lost";
-        ASSERT_TRUE(Stored(store) == Model(n))
+        ASSERT_TRUE(AllTables(store) == Model(n))
             << "round " << rounds << ": the tables are not those of the first " << n
             << " operations";
         durable = n;

@@ -1,6 +1,7 @@
 // The embedding API: recording and reading back, refusals, durability
 // through the journal, readers beside a writer, the cache bound.
 
+#include "tests/StoreTables.h"
 #include "tnStore/OffsetOpsStore.h"
 
 #include "tnStore/Journal.h"
@@ -28,19 +29,6 @@ Guid Site(uint32 n) {
 
 FieldId Field(uint64 oid, std::string_view path = "\x01") {
     return FieldId(OID(Seid(oid)), Path(path.data(), static_cast<ssize_t>(path.size())));
-}
-
-using Tables = std::map<FieldId, std::map<Guid, std::pair<int64, int64>>>;
-
-Tables All(OffsetOpsStore& store) {
-    Tables tables;
-    store.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
-        for (const auto& [site, so] : table.m_map.getmap()) {
-            tables[field][site] = {so.t, so.o};
-        }
-        return true;
-    });
-    return tables;
 }
 
 class StoreDir : public ::testing::Test {
@@ -98,10 +86,11 @@ TEST(OffsetOpsStoreMemory, RecordsFindsAndWalksInKeyOrder) {
 
     // From a key between stored keys, across batch boundaries, stopping early.
     std::vector<FieldId> seen;
-    store.ForEachFrom(Field(150, std::string_view("\x01\x00", 2)), [&](const FieldId& f, const auto&) {
-        seen.push_back(f);
-        return seen.size() < 400;
-    });
+    store.ForEachFrom(Field(150, std::string_view("\x01\x00", 2)),
+                      [&](const FieldId& f, const auto&) {
+                          seen.push_back(f);
+                          return seen.size() < 400;
+                      });
     ASSERT_EQ(seen.size(), 301u);
     EXPECT_EQ(seen.front(), Field(150, "\x02"));
     EXPECT_TRUE(std::is_sorted(seen.begin(), seen.end()));
@@ -164,13 +153,13 @@ TEST_F(StoreDir, ReopeningReplaysExactlyTheDurableOperations) {
     const Tables expected = {{Field(2), {{Site(2), {1, 7}}}}};
     {
         OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, Reading());
-        EXPECT_EQ(All(reader), expected);
+        EXPECT_EQ(AllTables(reader), expected);
         EXPECT_EQ(reader.Stats().replayedOperations, 3);
         EXPECT_THROW(reader.Record(Opid(Site(1), 9), Field(1), 1), RuntimeError);
     }
     {
         OffsetOpsStore writer = OffsetOpsStore::Open(m_dir);
-        EXPECT_EQ(All(writer), expected);
+        EXPECT_EQ(AllTables(writer), expected);
         const StoreStatistics stats = writer.Stats();
         EXPECT_EQ(stats.durableOperations, 4u);
         EXPECT_EQ(stats.checkpointedOperations, 1u);
@@ -178,7 +167,7 @@ TEST_F(StoreDir, ReopeningReplaysExactlyTheDurableOperations) {
         EXPECT_THROW(writer.Size(), RuntimeError);
     }
     OffsetOpsStore reopened = OffsetOpsStore::Open(m_dir);
-    EXPECT_EQ(All(reopened), expected);
+    EXPECT_EQ(AllTables(reopened), expected);
     EXPECT_EQ(reopened.Stats().replayedOperations, 0);  // Close checkpointed
     EXPECT_TRUE(reopened.Validate().Ok());
 }
@@ -193,7 +182,7 @@ TEST_F(StoreDir, TornJournalTailIsDroppedAndReported) {
     const std::string journal = m_dir + "/journal";
     fs::resize_file(journal, fs::file_size(journal) - 3);
     OffsetOpsStore store = OffsetOpsStore::Open(m_dir);
-    EXPECT_EQ(All(store), (Tables{{Field(1), {{Site(1), {1, 5}}}}}));
+    EXPECT_EQ(AllTables(store), (Tables{{Field(1), {{Site(1), {1, 5}}}}}));
     ASSERT_EQ(store.Repairs().size(), 1u);
     EXPECT_THAT(store.Repairs()[0], HasSubstr("incomplete last record"));
 }
@@ -242,7 +231,7 @@ TEST_F(StoreDir, ReadersSeeDurablePointsBesideAWriterAndSecondWritersAreRefused)
         int failures = 0;
         try {
             OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, Reading());
-            failures += All(reader) != Tables{{Field(1), {{Site(1), {1, 5}}}}};
+            failures += AllTables(reader) != Tables{{Field(1), {{Site(1), {1, 5}}}}};
         } catch (const std::exception& e) {
             std::fprintf(stderr, "reader: %s\n", e.what());
             failures += 10;
@@ -279,10 +268,10 @@ TEST_F(StoreDir, ACacheBoundKeepsTheSameTablesWithinTheBound) {
             }
         }
         EXPECT_GT(store.Stats().checkpoints, 1);
-        EXPECT_EQ(All(store), expected);
+        EXPECT_EQ(AllTables(store), expected);
     }
     OffsetOpsStore reopened = OffsetOpsStore::Open(m_dir, bounded);
-    EXPECT_EQ(All(reopened), expected);
+    EXPECT_EQ(AllTables(reopened), expected);
     EXPECT_TRUE(reopened.Validate().Ok());
     StoreOptions tiny;
     tiny.cacheObjects = 5;

@@ -9,8 +9,9 @@
 
 #include <xxhash.h>
 
-#include "tnUtils/RuntimeError.h"
 #include "tnUtils/Assert.h"
+#include "tnUtils/LittleEndian.h"
+#include "tnUtils/RuntimeError.h"
 
 namespace tarn {
 
@@ -19,20 +20,6 @@ namespace {
 constexpr octet_t kMagic[4] = {'T', 'N', 'I', 'M'};
 constexpr std::size_t kNameLengthOffset = 5;
 constexpr std::size_t kNameOffset = 9;
-
-void PutLe(octet_t* out, uint64 value, std::size_t width) {
-    for (std::size_t i = 0; i < width; ++i) {
-        out[i] = static_cast<octet_t>(value >> (8 * i));
-    }
-}
-
-uint64 GetLe(const octet_t* in, std::size_t width) {
-    uint64 value = 0;
-    for (std::size_t i = 0; i < width; ++i) {
-        value |= static_cast<uint64>(in[i]) << (8 * i);
-    }
-    return value;
-}
 
 uint64 Checksum(uint64 oid, const octet_t* bytes, std::size_t size) {
     return XXH3_64bits_withSeed(bytes, size, oid);

@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "tnUtils/Assert.h"
+#include "tnUtils/LittleEndian.h"
 #include "tnUtils/RuntimeError.h"
 
 namespace tarn {
@@ -31,20 +32,6 @@ constexpr std::size_t kGuidBytes = 16;
 constexpr std::size_t kMaxVarintBytes = 10;
 // Scans read the file this much at a time (more when one record is larger).
 constexpr std::size_t kReadChunk = std::size_t{4} << 20;
-
-void PutLe(octet_t* out, uint64 value, std::size_t width) {
-    for (std::size_t i = 0; i < width; ++i) {
-        out[i] = static_cast<octet_t>(value >> (8 * i));
-    }
-}
-
-uint64 GetLe(const octet_t* in, std::size_t width) {
-    uint64 value = 0;
-    for (std::size_t i = 0; i < width; ++i) {
-        value |= static_cast<uint64>(in[i]) << (8 * i);
-    }
-    return value;
-}
 
 octet_t* PutVarint(octet_t* out, uint64 value) {
     while (value >= 0x80) {

@@ -1,0 +1,26 @@
+#pragma once
+
+// Every table of a store as plain values, for comparing a store with a model.
+
+#include <map>
+#include <utility>
+
+#include "tnStore/OffsetOpsStore.h"
+
+namespace tarn {
+
+// field -> site -> (time stamp, sum)
+using Tables = std::map<FieldId, std::map<Guid, std::pair<int64, int64>>>;
+
+inline Tables AllTables(OffsetOpsStore& store) {
+    Tables tables;
+    store.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
+        for (const auto& [site, so] : table.m_map.getmap()) {
+            tables[field][site] = {so.t, so.o};
+        }
+        return true;
+    });
+    return tables;
+}
+
+}  // namespace tarn
