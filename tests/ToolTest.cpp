@@ -17,8 +17,8 @@ TEST(ToolTest, NeedsTheTools) {
 
 #include <algorithm>
 #include <functional>
-#include <regex>
 #include <set>
+#include <sstream>
 
 #include "tests/ToolSupport.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
@@ -46,9 +46,13 @@ auto OneLineWith(const std::string& part) {
 
 // The value of a "label   value" row of the program's output.
 std::string RowValue(const std::string& out, const std::string& label) {
-    std::smatch row;
-    return std::regex_search(out, row, std::regex("(^|\n)" + label + " +([^\n]*)")) ? row[2].str()
-                                                                                    : "";
+    std::istringstream lines(out);
+    for (std::string line; std::getline(lines, line);) {
+        if (line.size() > label.size() && line.starts_with(label) && line[label.size()] == ' ') {
+            return line.substr(line.find_first_not_of(' ', label.size()));
+        }
+    }
+    return "";
 }
 
 // `model` after the operations of an ops text, read as the program reads a
