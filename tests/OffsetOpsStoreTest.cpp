@@ -163,6 +163,10 @@ TEST_F(StoreDir, ReopeningReplaysExactlyTheDurableOperations) {
         const StoreStatistics stats = writer.Stats();
         EXPECT_EQ(stats.durableOperations, 4u);
         EXPECT_EQ(stats.checkpointedOperations, 1u);
+        // The refusals hold for what was stored and what was replayed alike.
+        EXPECT_THROW(writer.Record(Opid(Site(2), 0), Field(2), 1), RecordRefused);
+        EXPECT_THROW(writer.Record(Opid(Site(2), 1), Field(2), std::numeric_limits<int64>::max()),
+                     RecordRefused);
         writer.Close();
         EXPECT_THROW(writer.Size(), RuntimeError);
     }

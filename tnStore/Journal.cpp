@@ -501,19 +501,25 @@ Journal::~Journal() {
 
 void Journal::Add(const JournalEntry& entry) {
     if (entry.kind == JournalEntry::Kind::Clear) {
-        m_payload.push_back(kKindClear);
-        ++m_pendingCount;
+        AddClear();
         return;
     }
     TARN_ASSERT(entry.kind == JournalEntry::Kind::Record);
-    // clang-format off
-    TARN_ASSERT(0 <= entry.t && entry.t <= 4294967295);
-    // clang-format on
-    const std::size_t pathLength = static_cast<std::size_t>(entry.field.path.size());
+    AddRecord(entry.site, entry.t, entry.field, entry.offset);
+}
+
+void Journal::AddClear() {
+    m_payload.push_back(kKindClear);
+    ++m_pendingCount;
+}
+
+void Journal::AddRecord(const Guid& siteGuid, int64 t, const FieldId& field, int64 offset) {
+    TARN_ASSERT(0 <= t && t <= 4294967295);
+    const std::size_t pathLength = static_cast<std::size_t>(field.path.size());
     TARN_ASSERT(pathLength <= kMaxPathBytes);
 
     std::size_t site = 0;
-    while (site < m_sites.size() && m_sites[site] != entry.site) {
+    while (site < m_sites.size() && m_sites[site] != siteGuid) {
         ++site;
     }
     const std::size_t start = m_payload.size();
@@ -522,22 +528,22 @@ void Journal::Add(const JournalEntry& entry) {
     *p++ = kKindRecord;
     p = PutVarint(p, site);
     if (site == m_sites.size()) {
-        m_sites.push_back(entry.site);
-        PutLe(p, entry.site.Data1, 4);
-        PutLe(p + 4, entry.site.Data2, 2);
-        PutLe(p + 6, entry.site.Data3, 2);
-        std::memcpy(p + 8, entry.site.Data4, sizeof entry.site.Data4);
+        m_sites.push_back(siteGuid);
+        PutLe(p, siteGuid.Data1, 4);
+        PutLe(p + 4, siteGuid.Data2, 2);
+        PutLe(p + 6, siteGuid.Data3, 2);
+        std::memcpy(p + 8, siteGuid.Data4, sizeof siteGuid.Data4);
         p += kGuidBytes;
     }
-    p = PutVarint(p, static_cast<uint64>(entry.t));
-    p = PutVarint(p, entry.field.oid.value_);
+    p = PutVarint(p, static_cast<uint64>(t));
+    p = PutVarint(p, field.oid.value_);
     p = PutVarint(p, pathLength);
     if (pathLength > 0) {
-        std::memcpy(p, entry.field.path.data(), pathLength);
+        std::memcpy(p, field.path.data(), pathLength);
         p += pathLength;
     }
-    const uint64 offset = static_cast<uint64>(entry.offset);
-    p = PutVarint(p, (offset << 1) ^ (~(offset >> 63) + 1));
+    const uint64 bits = static_cast<uint64>(offset);
+    p = PutVarint(p, (bits << 1) ^ (~(bits >> 63) + 1));
     m_payload.resize(static_cast<std::size_t>(p - m_payload.data()));
     ++m_pendingCount;
 }

@@ -72,10 +72,10 @@ struct JournalEntry {
 
 // What a scan of a journal file found.
 struct JournalScan {
-    uint64 base = 0;          // sequence number of the first entry of the file
-    uint64 end = 0;           // sequence number after the last complete record
-    uint64 validBytes = 0;    // file bytes up to the end of the last complete record
-    uint64 fileBytes = 0;     // the file's size
+    uint64 base = 0;        // sequence number of the first entry of the file
+    uint64 end = 0;         // sequence number after the last complete record
+    uint64 validBytes = 0;  // file bytes up to the end of the last complete record
+    uint64 fileBytes = 0;   // the file's size
     bool tornTail() const { return fileBytes > validBytes; }
 };
 
@@ -111,6 +111,8 @@ public:
 
     // Encodes an entry into the pending record (memory only).
     void Add(const JournalEntry& entry);
+    void AddRecord(const Guid& site, int64 t, const FieldId& field, int64 offset);
+    void AddClear();
     // Appends the pending entries as one record and syncs the file (when
     // `sync`). Nothing pending: nothing written. On failure (a full disk,
     // an I/O error) the file is cut back to its previous end where possible,
@@ -119,7 +121,7 @@ public:
     void Commit();
 
     uint64 PendingEntries() const { return m_pendingCount; }
-    uint64 End() const { return m_end; }          // sequence number after the last appended entry
+    uint64 End() const { return m_end; }  // sequence number after the last appended entry
     uint64 FileBytes() const { return m_fileBytes; }
     const std::string& Path() const { return m_path; }
 

@@ -11,6 +11,7 @@
 #include "tnRuntime/MemoryStore.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnStore/StoreImpl.h"
+#include "tnStore/TreeWalk.h"
 
 namespace tarn {
 
@@ -66,13 +67,17 @@ std::optional<RecordRefused> Refusal(const Opid& opid, const FieldId& field, int
 }
 
 // Records one operation after the refusal checks; the caller holds the space
-// exclusively.
+// exclusively. When the bounds rule a refusal out, the field's table is not
+// looked up first.
 void CheckedRecord(OffsetOpsStore::Impl& s, const Opid& opid, const FieldId& field, int64 offset) {
-    FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
-    if (auto refusal = Refusal(opid, field, offset, map.rFind(field))) {
-        throw *refusal;
+    if (opid.t < 0 || opid.t > kMaxTimeStamp || !s.bounds.RulesOutRefusal(opid, offset)) {
+        FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
+        if (auto refusal = Refusal(opid, field, offset, map.rFind(field))) {
+            throw *refusal;
+        }
     }
     s.Record().RecordOffset(opid, field, offset);
+    s.bounds.Note(opid, offset);
 }
 
 // Replays one journal entry into the tree. A refused entry is damage: the
@@ -115,10 +120,22 @@ void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
 }
 
 // Checks the stored tree before anything walks it: the map's own code
-// trusts every node to be what its level says.
+// trusts every node to be what its level says. On a sound tree, takes the
+// refusal bounds from every table.
 void CheckStoredTree(OffsetOpsStore::Impl& s) {
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.openCheck = CheckTree(s.Map());
+    s.bounds = RefusalBounds();
+    if (s.openCheck.Ok()) {
+        WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
+                 [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
+                     for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
+                         for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
+                             s.bounds.NoteStored(site, so);
+                         }
+                     }
+                 });
+    }
     if (!s.reader && !s.openCheck.Ok()) {
         throw RuntimeError("store '" + s.dir + "': the stored tree is damaged (" +
                            std::to_string(s.openCheck.numProblems) + " problems; the first: " +
@@ -511,13 +528,8 @@ void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset
         throw;
     }
     if (s.journal != nullptr) {
-        JournalEntry entry;
-        entry.site = opid.s;
-        entry.t = opid.t;
-        entry.field = field;
-        entry.offset = offset;
         try {
-            s.journal->Add(entry);
+            s.journal->AddRecord(opid.s, opid.t, field, offset);
         } catch (...) {
             s.broken = true;
             throw;
@@ -534,9 +546,7 @@ void OffsetOpsStore::Clear() {
     try {
         s.Record().Clear();
         if (s.journal != nullptr) {
-            JournalEntry entry;
-            entry.kind = JournalEntry::Kind::Clear;
-            s.journal->Add(entry);
+            s.journal->AddClear();
         }
     } catch (...) {
         s.broken = true;

@@ -9,6 +9,8 @@
 // since the last durable point. The tree in memory always holds
 // durable + pending entries; the stored tree holds `checkpointed`.
 
+#include <algorithm>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -28,6 +30,41 @@ namespace tarn {
 // counter that holds the journal position of the last checkpoint.
 inline constexpr const char* kRecordRoot = "offsets";
 inline constexpr const char* kJournalPositionCounter = "journal-position";
+
+// Upper bounds on what the record's refusals depend on: the newest time
+// stamp of each site in any table, and the largest magnitude of any sum.
+// An operation whose stamp is not older than its site's newest and whose
+// offset cannot carry any sum past the 64-bit range can be refused for
+// nothing but its stamp's range, so Record skips looking up the field's
+// table for it. Clear leaves the bounds as they are: they stay upper bounds.
+class RefusalBounds {
+public:
+    bool RulesOutRefusal(const Opid& opid, int64 offset) const {
+        auto it = m_newest.find(opid.s);
+        return (it == m_newest.end() || opid.t >= it->second) &&
+               Magnitude(offset) <= kMaxSum - m_sum;
+    }
+    void Note(const Opid& opid, int64 offset) {
+        auto [it, added] = m_newest.emplace(opid.s, opid.t);
+        if (!added && it->second < opid.t) {
+            it->second = opid.t;
+        }
+        m_sum = std::min(kMaxSum, m_sum + std::min(kMaxSum, Magnitude(offset)));
+    }
+    void NoteStored(const Guid& site, const SiteOffset<int64>& so) {
+        Note(Opid(site, so.t), 0);
+        m_sum = std::min(kMaxSum, std::max(m_sum, Magnitude(so.o)));
+    }
+
+private:
+    static constexpr uint64 kMaxSum = 9223372036854775807;
+    static uint64 Magnitude(int64 v) {
+        return v < 0 ? uint64{0} - static_cast<uint64>(v) : static_cast<uint64>(v);
+    }
+
+    std::map<Guid, int64> m_newest;
+    uint64 m_sum = 0;  // at least the magnitude of every sum, at most kMaxSum
+};
 
 struct OffsetOpsStore::Impl {
     std::string dir;  // "" for an in-memory store
@@ -54,6 +91,7 @@ struct OffsetOpsStore::Impl {
     int64 replayed = 0;
     ssize_t peakResidents = 0;
     std::vector<std::string> repairs;
+    RefusalBounds bounds;
 
     FieldIdToOffsetOpsOnInt64FieldMap& Map() { return *(*record)->m_map; }
     OffsetOps& Record() { return **record; }
