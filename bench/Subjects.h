@@ -6,7 +6,8 @@
 //
 // TarnSubject is the offset operations record in its own object space (a
 // new in-memory store by default), held exclusively by the constructing
-// thread for the subject's lifetime. PeerSubject<M> is an ordinary
+// thread for the subject's lifetime; it registers the module's classes with
+// the runtime first. PeerSubject<M> is an ordinary
 // in-memory container M from field key to per-site table.
 
 #include <memory>
@@ -17,6 +18,7 @@
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
+#include "tnStore/RegisterClasses.h"
 
 namespace tarn::bench {
 
@@ -25,7 +27,7 @@ public:
     using MapType = FieldIdToOffsetOpsOnInt64FieldMap;
 
     explicit TarnSubject(std::shared_ptr<IStore> store = nullptr)
-        : m_space(std::move(store)),
+        : m_space(Registered(std::move(store))),
           m_guard(m_space, LockMode::Exclusive),
           m_record(CreatePersistent<OffsetOps>()) {}
 
@@ -38,6 +40,11 @@ public:
     CSpace& Space() { return m_space; }
 
 private:
+    static std::shared_ptr<IStore> Registered(std::shared_ptr<IStore> store) {
+        RegisterOffsetOpsClasses();
+        return store;
+    }
+
     CSpace m_space;  // destroyed last: after the guard has released it
     CSpaceGuard m_guard;
     OffsetOps* m_record;

@@ -385,6 +385,7 @@ void OffsetOpsStore::Impl::MakeRoom() {
                            ": it needs at least " + std::to_string(2 * room));
     }
     if (space->NumResidents() > limit) {
+        NotePeak();
         space->EvictCleanResidents(limit / 2);
     }
 }
@@ -401,6 +402,7 @@ void OffsetOpsStore::Impl::WriteCheckpoint() {
         space->Commit();
         checkpointed = durable;
         ++checkpoints;
+        NotePeak();
         if (options.cacheObjects > 0) {
             space->EvictCleanResidents(options.cacheObjects / 2);
         }
@@ -411,6 +413,12 @@ void OffsetOpsStore::Impl::WriteCheckpoint() {
             dir, JournalScan{durable, durable, Journal::kHeaderBytes, Journal::kHeaderBytes},
             options.sync);
     }
+}
+
+// Residents only grow inside operations and shrink only by eviction, so the
+// peak is taken before every eviction and whenever statistics are read.
+void OffsetOpsStore::Impl::NotePeak() {
+    peakResidents = std::max(peakResidents, space->NumResidents());
 }
 
 void OffsetOpsStore::Impl::Release() {
@@ -483,10 +491,12 @@ void OffsetOpsStore::Close() {
     if (!s.reader && !s.broken) {
         try {
             Sync();
+            // Nothing of an in-memory store outlives the handle.
             const bool changed =
-                s.space->NumDirty() > 0 || s.space->NumQueuedDeletions() > 0 ||
-                s.checkpointed != s.durable ||
-                (s.journal != nullptr && s.journal->FileBytes() > Journal::kHeaderBytes);
+                !s.dir.empty() &&
+                (s.space->NumDirty() > 0 || s.space->NumQueuedDeletions() > 0 ||
+                 s.checkpointed != s.durable ||
+                 (s.journal != nullptr && s.journal->FileBytes() > Journal::kHeaderBytes));
             if (changed) {
                 s.WriteCheckpoint();
             }
@@ -536,7 +546,6 @@ void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset
         }
     }
     ++s.pending;
-    s.peakResidents = std::max(s.peakResidents, s.space->NumResidents());
 }
 
 void OffsetOpsStore::Clear() {

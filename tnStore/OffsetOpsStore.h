@@ -125,7 +125,7 @@ struct StoreStatistics {
     int64 imagesWritten = 0;       // by this handle's checkpoints
     int64 imageBytesWritten = 0;   // their image bytes
     ssize_t residents = 0;         // tree objects in memory now
-    ssize_t peakResidents = 0;     // the most at once, measured after each operation
+    ssize_t peakResidents = 0;     // the most at once
     int64 replayedOperations = 0;  // replayed from the journal when opening
 
     int64 Nodes() const { return leaves + internalNodes; }
@@ -157,8 +157,10 @@ class OffsetOpsStore {
 public:
     // Opens the store in directory `dir` (see StoreOptions::mode).
     static OffsetOpsStore Open(const std::string& dir, const StoreOptions& options = {});
-    // A store that lives in memory only, for tests and scratch work: Sync and
-    // Checkpoint cost nothing and nothing outlives the handle.
+    // A store that lives in memory only, for tests and scratch work: nothing
+    // outlives the handle, Sync and Close write nothing, and Checkpoint (or a
+    // cache bound) copies the changed nodes into in-memory images, from which
+    // released nodes load again.
     static OffsetOpsStore OpenInMemory(const StoreOptions& options = {});
 
     OffsetOpsStore(OffsetOpsStore&&) noexcept;

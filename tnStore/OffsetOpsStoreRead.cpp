@@ -116,6 +116,7 @@ StoreStatistics OffsetOpsStore::Stats() {
     stats.imagesWritten = s.store->ImagesWritten();
     stats.imageBytesWritten = s.store->BytesWritten();
     stats.residents = s.space->NumResidents();
+    s.NotePeak();
     stats.peakResidents = s.peakResidents;
     stats.replayedOperations = s.replayed;
     return stats;

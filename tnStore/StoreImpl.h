@@ -106,6 +106,7 @@ struct OffsetOpsStore::Impl {
     void MakeRoom();
     // Writes the tree and the journal position (after a durable point).
     void WriteCheckpoint();
+    void NotePeak();
     void Release();
 };
 
