@@ -184,17 +184,19 @@ void RequireCheckpointInJournal(const OffsetOpsStore::Impl& s, const std::string
     }
 }
 
+RuntimeError MissingJournal(const OffsetOpsStore::Impl& s, const std::string& path) {
+    return RuntimeError("journal '" + path + "' is missing: the store's last checkpoint covers " +
+                        std::to_string(s.checkpointed) +
+                        " operations, and any made durable after it are lost");
+}
+
 // Writer: the journal after the last checkpoint, replayed; a torn tail cut.
 void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
     const std::string path = JournalPath(s.dir);
     std::error_code ec;
     if (!fs::exists(path, ec)) {
         if (!legacy) {
-            throw RuntimeError("journal '" + path +
-                               "' is missing: the store's last checkpoint "
-                               "covers " +
-                               std::to_string(s.checkpointed) +
-                               " operations, and any made durable after it are lost");
+            throw MissingJournal(s, path);
         }
         Journal::Reset(s.dir, s.checkpointed, s.options.sync);
         s.repairs.push_back("started a journal in '" + s.dir +
@@ -288,11 +290,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
             if (legacy) {
                 return;
             }
-            throw RuntimeError("journal '" + path +
-                               "' is missing: the store's last checkpoint "
-                               "covers " +
-                               std::to_string(s.checkpointed) +
-                               " operations, and any made durable after it are lost");
+            throw MissingJournal(s, path);
         }
         if (!s.openCheck.Ok()) {
             return;  // nothing is replayed into a damaged tree
