@@ -130,6 +130,8 @@ struct Model {
             bytes += static_cast<ssize_t>(ImageRecordSize(expected++->second));
         });
         EXPECT_TRUE(expected == images.end());
+        EXPECT_EQ(store.LargestIdentity(),
+                  images.empty() ? std::nullopt : std::optional(images.rbegin()->first));
         EXPECT_EQ(store.Roots(), roots);
         for (const char* name : {"journal", "c0", "c1", "c2"}) {
             const auto it = counters.find(name);

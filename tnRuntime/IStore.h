@@ -61,6 +61,13 @@ public:
     virtual void Commit(const CommitBatch& batch) = 0;
     // Calls `fn` for every stored identity, in increasing order.
     virtual void ForEachIdentity(const std::function<void(uint64)>& fn) = 0;
+    // The largest stored identity, nothing when the store holds no image.
+    // Stores that keep identities in order answer without a walk.
+    virtual std::optional<uint64> LargestIdentity() {
+        std::optional<uint64> largest;
+        ForEachIdentity([&](uint64 oid) { largest = oid; });
+        return largest;
+    }
     virtual StoreStats Stats() = 0;
 };
 

@@ -665,6 +665,26 @@ void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
     }
 }
 
+std::optional<uint64> LmdbStore::LargestIdentity() {
+    std::lock_guard lock(m_mutex);
+    ReadScope read(*this);
+    int rc = 0;
+    Cursor cursor(read.Txn(), m_images, &rc);
+    Check(rc, "finding the largest identity");
+    MDB_val key;
+    MDB_val value;
+    rc = cursor.Get(&key, &value, MDB_LAST);
+    if (rc == MDB_NOTFOUND) {
+        return std::nullopt;
+    }
+    Check(rc, "finding the largest identity");
+    if (key.mv_size != 8) {
+        Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
+             " bytes, expected 8");
+    }
+    return IdentityOfKey(key);
+}
+
 StoreStats LmdbStore::Stats() {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);

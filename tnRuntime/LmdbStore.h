@@ -105,6 +105,7 @@ public:
     uint64 NextIdentity() override;
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;
+    std::optional<uint64> LargestIdentity() override;
     StoreStats Stats() override;
 
     const std::string& Directory() const { return m_dir; }

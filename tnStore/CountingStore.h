@@ -35,6 +35,7 @@ public:
     void ForEachIdentity(const std::function<void(uint64)>& fn) override {
         m_inner->ForEachIdentity(fn);
     }
+    std::optional<uint64> LargestIdentity() override { return m_inner->LargestIdentity(); }
     StoreStats Stats() override { return m_inner->Stats(); }
 
     int64 ImagesWritten() const { return m_imagesWritten; }

@@ -248,8 +248,7 @@ void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
 // image.
 void RequireIdentitiesAhead(OffsetOpsStore::Impl& s) {
     const uint64 next = s.store->NextIdentity();
-    uint64 largest = 0;
-    s.store->ForEachIdentity([&](uint64 oid) { largest = std::max(largest, oid); });
+    const uint64 largest = s.store->LargestIdentity().value_or(0);
     if (largest >= next) {
         throw RuntimeError("store '" + s.dir + "' is damaged: its identity counter " +
                            std::to_string(next) + " is not above the stored identity #" +
