@@ -1,12 +1,22 @@
-// Crash safety: a child process records a fixed stream of operations into a
-// store, with a durable point every kK operations, and is killed with SIGKILL
-// at a random moment: while it opens the store and replays its journal,
-// while it appends, while it checkpoints. Many rounds over one store; every
-// round's child goes on from what the store holds. After every kill the
-// store opens and holds exactly the first N operations of the stream, N a
-// multiple of kK, and at least as many as the child was told were durable.
+// Crash safety: a child process records an ops file into a store, with a
+// durable point every kK operations, and is killed with SIGKILL at a random
+// moment: while it opens the store and replays its journal, while it
+// appends, while it checkpoints. Many rounds over one store; every round's
+// child goes on from the operation of the file where the store ends. After
+// every kill the store opens and holds exactly the first N operations of the
+// file, N a multiple of kK, and at least as many as the child was told were
+// durable.
 
 #include <gtest/gtest.h>
+
+#ifndef TARN_HAVE_TOOLS
+
+TEST(CrashTest, NeedsTheOpsFileReader) {
+    GTEST_SKIP() << "configure with -DTARN_BUILD_TOOLS=ON to build the ops-file reader";
+}
+
+#else
+
 #include <signal.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -16,28 +26,27 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <map>
 #include <random>
 
 #include "tests/StoreTables.h"
 #include "tnStore/OffsetOpsStore.h"
+#include "tools/OpsFile.h"
 
 namespace tarn {
 namespace {
 
 constexpr int64 kK = 50;
 constexpr int64 kFields = 3000;
+// The file's length, a multiple of kK: a child that reaches its end waits
+// for the kill holding the store.
+constexpr int64 kFileOps = 200 * 1000;
 // Rounds go on until the time budget is spent, but never fewer than
 // kMinRounds however slow the machine, nor more than kMaxRounds.
 constexpr auto kTimeBudget = std::chrono::seconds(25);
 constexpr int kMinRounds = 30;
 constexpr int kMaxRounds = 300;
-
-struct Op {
-    Opid opid;
-    FieldId field;
-    int64 offset;
-};
 
 Guid Site(int64 n) {
     Guid g{};
@@ -46,12 +55,12 @@ Guid Site(int64 n) {
     return g;
 }
 
-// Operation i of an endless, fixed stream: three sites whose time stamps
-// rise with i, fields visited in a scattered order, paths of 0 to 3 bytes.
-Op OpAt(int64 i) {
+// Operation i of the file: three sites whose time stamps rise with i, fields
+// visited in a scattered order, paths of 0 to 3 bytes.
+tool::OffsetOperation OpAt(int64 i) {
     const int64 key = i * 7919 % kFields;
     const char path[3] = {static_cast<char>(key % 7), static_cast<char>(key % 5), '\x7f'};
-    return {Opid(Site(1 + i % 3), i / 3 + 1),
+    return {Site(1 + i % 3), i / 3 + 1,
             FieldId(OID(Seid(static_cast<uint64>(1 + key / 4))), Path(path, key % 4)),
             i * 31 % 2001 - 1000};
 }
@@ -59,25 +68,33 @@ Op OpAt(int64 i) {
 Tables Model(int64 n) {
     Tables model;
     for (int64 i = 0; i < n; ++i) {
-        const Op op = OpAt(i);
-        auto& so = model[op.field][op.opid.s];
-        so.first = op.opid.t;
+        const tool::OffsetOperation op = OpAt(i);
+        auto& so = model[op.field][op.site];
+        so.first = op.t;
         so.second += op.offset;
     }
     return model;
 }
 
-// The child: opens the store (replaying its journal), then records the
-// stream from where the store ends, a durable point every kK operations,
-// reporting each durable count on `fd`, until it is killed.
-[[noreturn]] void RecordUntilKilled(const std::string& dir, std::size_t journalLimit, int fd) {
+// The child: opens the store (replaying its journal), then records the ops
+// file from the operation where the store ends, a durable point every kK
+// operations, reporting each durable count on `fd`, until it is killed.
+[[noreturn]] void RecordUntilKilled(const std::string& dir, const std::string& opsFile,
+                                    std::size_t journalLimit, int fd) {
     try {
         StoreOptions options;
         options.journalLimitBytes = journalLimit;
         OffsetOpsStore store = OffsetOpsStore::Open(dir, options);
-        for (auto i = static_cast<int64>(store.Stats().durableOperations);; ++i) {
-            const Op op = OpAt(i);
-            store.Record(op.opid, op.field, op.offset);
+        const auto start = static_cast<int64>(store.Stats().durableOperations);
+        std::ifstream in(opsFile);
+        tool::OpsFileReader reader(in, opsFile);
+        tool::OffsetOperation op;
+        std::string error;
+        for (int64 i = 0; reader.Next(op, error) == tool::OpsFileReader::Status::Operation; ++i) {
+            if (i < start) {
+                continue;
+            }
+            store.Record(Opid(op.site, op.t), op.field, op.offset);
             if ((i + 1) % kK == 0) {
                 store.Sync();
                 const int64 durable = i + 1;
@@ -86,6 +103,11 @@ Tables Model(int64 n) {
                 }
             }
         }
+        if (!error.empty()) {
+            ::_exit(6);
+        }
+        ::pause();
+        ::_exit(7);
     } catch (const std::exception& e) {
         [[maybe_unused]] const auto written = ::write(2, e.what(), std::strlen(e.what()));
         ::_exit(4);
@@ -96,6 +118,13 @@ TEST(CrashTest, KilledWriterKeepsExactlyADurablePoint) {
     const std::string dir = ::testing::TempDir() + "/crash-" + std::to_string(::getpid());
     std::filesystem::remove_all(dir);
     OffsetOpsStore::Open(dir).Close();
+    const std::string opsFile = dir + ".ops";
+    {
+        std::ofstream out(opsFile);
+        for (int64 i = 0; i < kFileOps; ++i) {
+            out << tool::FormatOpsLine(OpAt(i)) << '\n';
+        }
+    }
     std::mt19937 random(20261123);
     // Small limits checkpoint every few durable points; large ones leave a
     // long journal for the next child to replay.
@@ -112,7 +141,7 @@ TEST(CrashTest, KilledWriterKeepsExactlyADurablePoint) {
         const pid_t pid = ::fork();
         if (pid == 0) {
             ::close(fds[0]);
-            RecordUntilKilled(dir, limit, fds[1]);
+            RecordUntilKilled(dir, opsFile, limit, fds[1]);
         }
         ::close(fds[1]);
         // Every other round is killed at a random moment from the start (it
@@ -150,7 +179,10 @@ TEST(CrashTest, KilledWriterKeepsExactlyADurablePoint) {
     RecordProperty("rounds", rounds);
     RecordProperty("operations", static_cast<int>(durable));
     std::filesystem::remove_all(dir);
+    std::filesystem::remove(opsFile);
 }
 
 }  // namespace
 }  // namespace tarn
+
+#endif  // TARN_HAVE_TOOLS
