@@ -34,10 +34,15 @@ std::string NodesText(const StoreStatistics& stats) {
            std::to_string(stats.internalNodes) + " internal)";
 }
 
-OffsetOpsStore OpenReader(const std::string& dir) {
+// Opens the store and says on `err` what opening repaired.
+OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostream& err) {
     StoreOptions options;
-    options.mode = StoreMode::Read;
-    return OffsetOpsStore::Open(dir, options);
+    options.mode = mode;
+    OffsetOpsStore store = OffsetOpsStore::Open(dir, options);
+    for (const std::string& repair : store.Repairs()) {
+        err << "offsetops: " << dir << ": repaired: " << repair << '\n';
+    }
+    return store;
 }
 
 // Refuses a tree that a walk over all of it could not take safely (the store
@@ -293,7 +298,7 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
 
 int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
             std::ostream& out, std::ostream& err) {
-    OffsetOpsStore opened = OpenReader(store);
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
     OstreamOutputStream sink(out);
     xostream os(sink);
     if (field) {
@@ -320,14 +325,14 @@ int RunShow(const std::string& store, const std::optional<FieldId>& field, int64
     return 0;
 }
 
-int RunDump(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    OffsetOpsStore opened = OpenReader(store);
+int RunDump(const std::string& store, std::ostream& out, std::ostream& err) {
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
     opened.Dump(out);
     return 0;
 }
 
 int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) {
-    OffsetOpsStore opened = OpenReader(store);
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
     const StoreValidation v = opened.Validate();
     std::vector<std::string> problems = v.check.problems;
     int64 numProblems = v.check.numProblems;
@@ -372,8 +377,8 @@ int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) 
     return 0;
 }
 
-int RunStats(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    OffsetOpsStore opened = OpenReader(store);
+int RunStats(const std::string& store, std::ostream& out, std::ostream& err) {
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
     RequireSoundTree(opened);  // the counts of a damaged tree mean little
     const StoreStatistics stats = opened.Stats();
     Row(out, "images", std::to_string(stats.images));
@@ -387,10 +392,8 @@ int RunStats(const std::string& store, std::ostream& out, std::ostream& /*err*/)
     return 0;
 }
 
-int RunClear(const std::string& store, std::ostream& out, std::ostream& /*err*/) {
-    StoreOptions options;
-    options.mode = StoreMode::WriteExisting;
-    OffsetOpsStore opened = OffsetOpsStore::Open(store, options);
+int RunClear(const std::string& store, std::ostream& out, std::ostream& err) {
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::WriteExisting, err);
     // Clearing hands the whole tree to deletion, which walks it: refuse a
     // damaged tree first.
     RequireSoundTree(opened);
