@@ -265,15 +265,15 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
         {{"record", "--store", store, "--generate", "9", "--sites", "1"},
          1,
          "generated operation 1: site " + ToString(Generator::SiteGuid(1)) + " has no time stamps"},
-        // The tree outgrows the bound mid-run: the store keeps the last
-        // durable point.
+        // The tree outgrows the bound mid-run: the operation that would
+        // pass it changes nothing, everything before it is made durable.
         {{"record", "--store", dir.Sub("grown"), "--generate", "500", "--cache-nodes", "12",
           "--commit-every", "100"},
          1,
          "--cache-nodes 12" + tooSmall + "1 needs at least " +
              std::to_string(OffsetOpsStore::MinCacheObjects(1)) +
              " objects in memory, and the tree has grown to that height; stopped there: the "
-             "store keeps its last durable point, with the 200 operations of this run"},
+             "264 operations of this run before it are durable, nothing from it on"},
         {record, 1,
          "ops.txt:5: offset '3x' is not a signed decimal integer; stopped there: the 3 "
          "operations of this run before it are durable, nothing from it on",

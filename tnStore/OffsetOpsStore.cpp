@@ -561,27 +561,41 @@ void OffsetOpsStore::Clear() {
     ++s.pending;
 }
 
+// A failed append or checkpoint breaks the handle: the store keeps its last
+// durable point, and nothing recorded after it may become durable later (a
+// caller told of the failure counts those operations as lost). Reopen the
+// store to go on.
 void OffsetOpsStore::Sync() {
     Impl& s = *m_impl;
     s.RequireWritable();
-    if (s.journal != nullptr) {
-        s.journal->Commit();  // a failure keeps the entries pending: Sync may be retried
-    }
-    s.durable += static_cast<uint64>(s.pending);
-    s.pending = 0;
-    const bool journalFull =
-        s.journal != nullptr && s.journal->FileBytes() > s.options.journalLimitBytes;
-    const bool cacheFull = s.options.cacheObjects > 0 &&
-                           s.space->NumResidents() > s.options.cacheObjects &&
-                           s.space->NumDirty() > 0;
-    if (journalFull || cacheFull) {
-        s.WriteCheckpoint();
+    try {
+        if (s.journal != nullptr) {
+            s.journal->Commit();
+        }
+        s.durable += static_cast<uint64>(s.pending);
+        s.pending = 0;
+        const bool journalFull =
+            s.journal != nullptr && s.journal->FileBytes() > s.options.journalLimitBytes;
+        const bool cacheFull = s.options.cacheObjects > 0 &&
+                               s.space->NumResidents() > s.options.cacheObjects &&
+                               s.space->NumDirty() > 0;
+        if (journalFull || cacheFull) {
+            s.WriteCheckpoint();
+        }
+    } catch (...) {
+        s.broken = true;
+        throw;
     }
 }
 
 void OffsetOpsStore::Checkpoint() {
     Sync();
-    m_impl->WriteCheckpoint();
+    try {
+        m_impl->WriteCheckpoint();
+    } catch (...) {
+        m_impl->broken = true;
+        throw;
+    }
 }
 
 }  // namespace tarn

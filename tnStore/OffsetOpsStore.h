@@ -51,9 +51,11 @@
 // is wrong: a missing, unreadable or damaged store, journal or lock file, a
 // full disk ("no space left on device"), a second writer. Record refuses an
 // operation that the record must not be given by throwing RecordRefused,
-// which names the field and the site and changes nothing. After any other
-// error while writing, the handle is broken: further writes throw, nothing
-// more becomes durable, and the store on disk keeps its last durable point.
+// which names the field and the site and changes nothing; so does a cache
+// bound too small for the tree (a RuntimeError). After any other error while
+// writing (a failed load, append, sync or checkpoint), the handle is broken:
+// further writes throw, nothing more becomes durable, Close only releases,
+// and the store on disk keeps its last durable point; reopen it to go on.
 
 #include <cstddef>
 #include <functional>

@@ -275,20 +275,30 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
                 std::chrono::duration<double>(Clock::now() - start).count());
         return 0;
     } catch (const RuntimeError& e) {
-        // The handle is broken: nothing more becomes durable.
         progress.Finish();
         std::string what = e.what();
         if (bound > 0) {
-            // The store refuses to go on when the tree outgrows the bound;
-            // say so in terms of the option.
+            // The store refuses, changing nothing, an operation that would
+            // take the tree past the bound: like refused input, everything
+            // before it is made durable. Say so in terms of the option.
             try {
                 const ssize_t height = store.Stats().height;
                 if (bound < OffsetOpsStore::MinCacheObjects(height)) {
-                    what = CacheTooSmall(bound, height) + ", and the tree has grown to that height";
+                    const std::string where = position();
+                    finishing = true;
+                    sync();
+                    store.Close();
+                    return Fail(err, where + ": " + CacheTooSmall(bound, height) +
+                                         ", and the tree has grown to that height; stopped "
+                                         "there: the " +
+                                         std::to_string(durable) +
+                                         " operations of this run before it are durable, "
+                                         "nothing from it on");
                 }
             } catch (const RuntimeError&) {
             }
         }
+        // Any other error broke the handle: nothing more becomes durable.
         return Fail(err, position() + ": " + what +
                              "; stopped there: the store keeps its last durable point, with the " +
                              std::to_string(durable) + " operations of this run before it; the " +
