@@ -364,4 +364,15 @@ inline std::optional<uint64> ParseCount(std::string text) {
     std::exit(2);
 }
 
+// The whole of a job program's main: runs `job`, and reports an exception
+// as one line on standard error and status 1.
+inline int RunJob(const char* program, int (*job)(int, char**), int argc, char** argv) {
+    try {
+        return job(argc, argv);
+    } catch (const std::exception& e) {
+        std::fprintf(stderr, "%s: %s\n", program, e.what());
+        return 1;
+    }
+}
+
 }  // namespace tarn::bench

@@ -284,10 +284,5 @@ int Main(int argc, char** argv) {
 }  // namespace tarn::bench
 
 int main(int argc, char** argv) {
-    try {
-        return tarn::bench::Main(argc, argv);
-    } catch (const std::exception& e) {
-        std::fprintf(stderr, "RecoveryJob: %s\n", e.what());
-        return 1;
-    }
+    return tarn::bench::RunJob("RecoveryJob", tarn::bench::Main, argc, argv);
 }

@@ -17,6 +17,7 @@
 
 #include "tnUtils/RuntimeError.h"
 #include "tnUtils/Types.h"
+#include "tnUtils/UniqueFd.h"
 
 namespace tarn {
 
@@ -116,15 +117,8 @@ std::string Hex(uint64 value) {
 class File {
 public:
     explicit File(const std::string& path) : m_fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC)) {}
-    ~File() {
-        if (m_fd >= 0) {
-            ::close(m_fd);
-        }
-    }
-    File(const File&) = delete;
-    File& operator=(const File&) = delete;
 
-    int Fd() const { return m_fd; }
+    int Fd() const { return m_fd.Get(); }
 
     // Reads `size` bytes at `offset`; false when the file ends before (errno
     // 0) or reading fails.
@@ -133,7 +127,7 @@ public:
         std::size_t done = 0;
         while (done < size) {
             const ssize_t n =
-                ::pread(m_fd, out + done, size - done, static_cast<off_t>(offset + done));
+                ::pread(m_fd.Get(), out + done, size - done, static_cast<off_t>(offset + done));
             if (n < 0 && errno == EINTR) {
                 continue;
             }
@@ -146,7 +140,7 @@ public:
     }
 
 private:
-    int m_fd;
+    UniqueFd m_fd;
 };
 
 bool PlausiblePageSize(uint64 size) {

@@ -17,6 +17,7 @@
 #include "tnUtils/Assert.h"
 #include "tnUtils/LittleEndian.h"
 #include "tnUtils/RuntimeError.h"
+#include "tnUtils/UniqueFd.h"
 
 namespace tarn {
 
@@ -97,24 +98,6 @@ void EncodeFileHeader(uint64 base, octet_t* out) {
 uint32 RecordHeaderChecksum(const octet_t* header) {
     return static_cast<uint32>(XXH3_64bits(header, 20));
 }
-
-// Closes the descriptor it holds when it goes out of scope.
-class Fd {
-public:
-    explicit Fd(int fd) : m_fd(fd) {}
-    ~Fd() {
-        if (m_fd >= 0) {
-            ::close(m_fd);
-        }
-    }
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    int Get() const { return m_fd; }
-    int Release() { return std::exchange(m_fd, -1); }
-
-private:
-    int m_fd;
-};
 
 void WriteAll(int fd, const octet_t* bytes, std::size_t size, uint64 at, const std::string& path) {
     std::size_t done = 0;
@@ -305,7 +288,7 @@ bool AllZeros(FileReader& reader, uint64 pos, uint64 end) {
 }  // namespace
 
 JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& apply) {
-    Fd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (fd.Get() < 0) {
         if (errno == ENOENT) {
             throw RuntimeError("journal '" + path + "' does not exist");
@@ -427,7 +410,7 @@ void Journal::Reset(const std::string& dir, uint64 base, bool sync) {
     octet_t header[kHeaderBytes];
     EncodeFileHeader(base, header);
     try {
-        Fd fd(::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
+        UniqueFd fd(::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
         if (fd.Get() < 0) {
             IoError(temp, "create", errno);
         }
@@ -447,7 +430,7 @@ void Journal::Reset(const std::string& dir, uint64 base, bool sync) {
     }
     if (sync) {
         const std::string where = dir.empty() ? "." : dir;
-        Fd dirFd(::open(where.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        UniqueFd dirFd(::open(where.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (dirFd.Get() < 0 || ::fsync(dirFd.Get()) != 0) {
             const int error = errno;
             throw RuntimeError("journal '" + target + "': cannot sync directory '" + where +
@@ -463,7 +446,7 @@ Journal::Journal(const std::string& dir, const JournalScan& scan, bool sync)
       m_fileBytes(scan.validBytes) {
     // A scan always covers the file header; anything less would cut the file.
     TARN_ASSERT(scan.validBytes >= kHeaderBytes && scan.end >= scan.base);
-    Fd fd(::open(m_path.c_str(), O_WRONLY | O_CLOEXEC));
+    UniqueFd fd(::open(m_path.c_str(), O_WRONLY | O_CLOEXEC));
     if (fd.Get() < 0) {
         if (errno == ENOENT) {
             throw RuntimeError("journal '" + m_path + "' does not exist");
