@@ -230,10 +230,14 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
         std::string kept = {};
     };
     std::vector<Case> cases = {
-        {{}, 2, "a command is needed: record, show, dump, validate, stats or clear" + help},
+        {{},
+         2,
+         "a command is needed: record, show, export, diff, backup, dump, validate, stats or clear" +
+             help},
         {{"frobnicate"},
          2,
-         "unknown command 'frobnicate': use record, show, dump, validate, stats or"},
+         "unknown command 'frobnicate': use record, show, export, diff, backup, dump, validate, "
+         "stats or"},
         {{"--bogus", "show"}, 2, "unknown option '--bogus': options follow the command" + help},
         {{"stats", "--store", store, "-x"}, 2, "option '-x' for stats (see 'offsetops stats --"},
         {{"validate", "--store", store, "extra"}, 2, "unexpected argument 'extra' for validate"},

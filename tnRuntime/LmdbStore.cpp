@@ -24,6 +24,7 @@
 #include "tnRuntime/ImageRecord.h"
 #include "tnRuntime/LmdbFileCheck.h"
 #include "tnUtils/Assert.h"
+#include "tnUtils/UniqueFd.h"
 
 namespace tarn {
 
@@ -565,6 +566,53 @@ std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
     return value;
 }
 
+std::optional<uint64> LmdbStore::FindLatestCounter(std::string_view name) {
+    if (!m_readOnly) {
+        return FindCounter(name);
+    }
+    std::lock_guard lock(m_mutex);
+    // A second read transaction beside the snapshot (the environment is
+    // opened with MDB_NOTLS, so one thread may hold both).
+    MDB_txn* txn = nullptr;
+    const int rc = mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &txn);
+    if (rc == MDB_MAP_RESIZED) {
+        Fail("the writer has grown the store since it was opened here; open it again");
+    }
+    Check(rc, "beginning a read transaction");
+    bool found = false;
+    uint64 value = 0;
+    try {
+        value = ReadMeta64(txn, MetaKey(kCounterPrefix, name), &found);
+    } catch (...) {
+        mdb_txn_abort(txn);
+        throw;
+    }
+    mdb_txn_abort(txn);
+    if (!found) {
+        return std::nullopt;
+    }
+    return value;
+}
+
+void LmdbStore::CopyTo(const std::string& dir, bool compact) {
+    std::lock_guard lock(m_mutex);
+    const int rc = mdb_env_copy2(m_env, dir.c_str(), compact ? MDB_CP_COMPACT : 0);
+    if (rc == MDB_MAP_RESIZED) {
+        Fail("the writer has grown the store since it was opened here; open it again");
+    }
+    if (rc != MDB_SUCCESS) {
+        Fail("copying to '" + dir + "': " + LmdbFailureText(dir, rc, mdb_strerror(rc)));
+    }
+    // LMDB closes the copy without syncing it.
+    const std::string copy = (std::filesystem::path(dir) / "data.mdb").string();
+    UniqueFd fd(::open(copy.c_str(), O_RDONLY | O_CLOEXEC));
+    if (fd.Get() < 0 || ::fsync(fd.Get()) != 0) {
+        const int error = errno;
+        Fail("syncing the copy '" + copy +
+             "': " + LmdbFailureText(dir, error, std::strerror(error)));
+    }
+}
+
 uint64 LmdbStore::NextIdentity() {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);
@@ -706,6 +754,15 @@ StoreStats LmdbStore::Stats() {
         Check(rc, "measuring the images");
     }
     return stats;
+}
+
+uint64 LmdbStore::DataBytes() {
+    std::lock_guard lock(m_mutex);
+    MDB_envinfo info;
+    Check(mdb_env_info(m_env, &info), "reading the environment's size");
+    MDB_stat stat;
+    Check(mdb_env_stat(m_env, &stat), "reading the environment's page size");
+    return (static_cast<uint64>(info.me_last_pgno) + 1) * stat.ms_psize;
 }
 
 std::size_t LmdbStore::MapSize() {

@@ -108,6 +108,18 @@ public:
     std::optional<uint64> LargestIdentity() override;
     StoreStats Stats() override;
 
+    // The named counter as the latest commit holds it, also for a ReadOnly
+    // store (whose other reads see its snapshot).
+    std::optional<uint64> FindLatestCounter(std::string_view name);
+    // Writes a copy of the environment as of the latest commit into the
+    // existing directory `dir`, as its data.mdb (which must not exist yet),
+    // synced. `compact` leaves out free pages and renumbers the rest, so the
+    // copy is as small as its contents. Runs beside the writer; a copy holds
+    // one commit, whatever the writer commits meanwhile.
+    void CopyTo(const std::string& dir, bool compact);
+    // The bytes of the data file that the latest commit uses.
+    uint64 DataBytes();
+
     const std::string& Directory() const { return m_dir; }
     // What opening repaired (a lock file made anew), one line each.
     const std::vector<std::string>& Repairs() const { return m_repairs; }

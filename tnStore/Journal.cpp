@@ -287,7 +287,7 @@ bool AllZeros(FileReader& reader, uint64 pos, uint64 end) {
 
 }  // namespace
 
-JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& apply) {
+int Journal::OpenForReading(const std::string& path) {
     UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (fd.Get() < 0) {
         if (errno == ENOENT) {
@@ -295,11 +295,20 @@ JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& a
         }
         IoError(path, "open", errno);
     }
+    return fd.Release();
+}
+
+JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& apply) {
+    UniqueFd fd(OpenForReading(path));
+    return Scan(fd.Get(), path, from, apply);
+}
+
+JournalScan Journal::Scan(int fd, const std::string& path, uint64 from, const EntryFn& apply) {
     struct stat st;
-    if (::fstat(fd.Get(), &st) != 0) {
+    if (::fstat(fd, &st) != 0) {
         IoError(path, "stat", errno);
     }
-    FileReader reader(fd.Get(), path, static_cast<uint64>(st.st_size));
+    FileReader reader(fd, path, static_cast<uint64>(st.st_size));
     if (reader.Size() < kHeaderBytes) {
         Damage(path, 0,
                "the file is " + std::to_string(reader.Size()) + " bytes, shorter than its header");

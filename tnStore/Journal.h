@@ -95,6 +95,12 @@ public:
     // is applied. Throws RuntimeError for a missing or unreadable file and for
     // damage (see above); a torn tail ends the scan.
     static JournalScan Scan(const std::string& path, uint64 from, const EntryFn& apply);
+    // The same on a journal opened with OpenForReading; `path` names it in
+    // messages. The descriptor's file position is not used.
+    static JournalScan Scan(int fd, const std::string& path, uint64 from, const EntryFn& apply);
+    // Opens the journal file `path` for Scan; the caller closes the
+    // descriptor. Throws RuntimeError when it is missing or unreadable.
+    static int OpenForReading(const std::string& path);
 
     // Makes `dir`/journal an empty journal whose base is `base`, atomically:
     // written to "journal.new", synced (when `sync`), renamed over the

@@ -124,7 +124,7 @@ void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
 // refusal bounds from every table.
 void CheckStoredTree(OffsetOpsStore::Impl& s) {
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.openCheck = CheckTree(s.Map());
+    s.openCheck = CheckTree(s);
     s.bounds = RefusalBounds();
     if (s.openCheck.Ok()) {
         WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
@@ -155,6 +155,7 @@ std::unique_ptr<LmdbStore> OpenLmdb(OffsetOpsStore::Impl& s) {
                                                            : OpenMode::CreateIfMissing;
     lmdb.syncOnCommit = options.sync;
     std::unique_ptr<LmdbStore> store = LmdbStore::Open(dir, lmdb);
+    s.lmdb = store.get();
     // What opening the environment repaired (a lock file made anew).
     s.repairs.insert(s.repairs.end(), store->Repairs().begin(), store->Repairs().end());
     return store;
@@ -279,6 +280,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
         // previous attempt's snapshot before taking the next.
         s.record.reset();
         s.space.reset();
+        s.lmdb = nullptr;
         s.store.reset();
         OpenSpace(s, OpenLmdb(s));
         const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
@@ -422,6 +424,7 @@ void OffsetOpsStore::Impl::Release() {
     record.reset();
     space.reset();
     journal.reset();
+    lmdb = nullptr;
     store.reset();
     closed = true;
 }

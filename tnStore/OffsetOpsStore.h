@@ -155,6 +155,25 @@ struct StoreValidation {
     bool Ok() const { return check.Ok() && mapValid && unreachable.empty(); }
 };
 
+struct BackupOptions {
+    // Leave out free pages and renumber the rest (LMDB's compacting copy):
+    // the copy is as small as its contents.
+    bool compact = false;
+    // Called a few times a second while the data file is copied, from
+    // another thread, with the bytes copied so far and about how many there
+    // are (a compacting copy ends below that).
+    using ProgressFn = std::function<void(uint64 copied, uint64 total)>;
+    ProgressFn progress;
+};
+
+// What a backup holds.
+struct BackupResult {
+    uint64 durableOperations = 0;       // the durable point it holds
+    uint64 checkpointedOperations = 0;  // of those, in its data file
+    int64 dataBytes = 0;                // its data file
+    int64 journalBytes = 0;             // its journal
+};
+
 class OffsetOpsStore {
 public:
     // Opens the store in directory `dir` (see StoreOptions::mode).
@@ -198,6 +217,9 @@ public:
     void ForEachOfObject(OID oid, const FieldVisitor& fn);
     // The number of fields that hold a table.
     int64 Size();
+    // The tree's height: its internal levels above the leaves, -1 when it has
+    // no root yet.
+    ssize_t Height();
     bool Empty() { return Size() == 0; }
 
     // Counts the nodes by walking the tree (within the cache bound); on a
@@ -208,6 +230,23 @@ public:
     // The tree, node by node (after the check; throws RuntimeError on a
     // damaged tree).
     void Dump(std::ostream& out);
+
+    // --- Backups ----------------------------------------------------------------
+
+    // Copies the store in directory `from` into the directory `to`, which must
+    // not exist or be empty: the data file as of its latest checkpoint and
+    // the journal's complete records after it, so that the copy holds the
+    // latest durable point reached before the copy finished. Runs beside a
+    // writer in another process, which it neither waits for nor blocks;
+    // nothing of the source changes. The copy appears at `to` only when
+    // complete (it is made in a sibling directory, synced, and renamed);
+    // on failure nothing is left behind. A store that is open in this
+    // process is copied with the member below.
+    static BackupResult Backup(const std::string& from, const std::string& to,
+                               const BackupOptions& options = {});
+    // The same for the store of this handle (on-disk stores only); a
+    // writer's operations since its last durable point are not in the copy.
+    BackupResult Backup(const std::string& to, const BackupOptions& options = {});
 
     // --- Lifetime ---------------------------------------------------------------
 

@@ -24,9 +24,10 @@ using Entry = std::pair<FieldId, OffsetOpsOnField<int64>>;
 
 }  // namespace
 
-StoreCheck CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map) {
-    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result =
-        FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
+StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
+    const ssize_t bound = s.options.cacheObjects;
+    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result = FieldIdToOffsetOpsOnInt64FieldMapCheck(
+        s.Map(), [&] { KeepResidentsUnder(*s.space, bound); });
     StoreCheck check;
     check.problems = std::move(result.problems);
     check.numProblems = result.numProblems;
@@ -91,6 +92,13 @@ int64 OffsetOpsStore::Size() {
     return s.Map().size();
 }
 
+ssize_t OffsetOpsStore::Height() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    return s.Map().m_height;
+}
+
 StoreStatistics OffsetOpsStore::Stats() {
     Impl& s = *m_impl;
     s.RequireOpen();
@@ -126,7 +134,7 @@ StoreCheck OffsetOpsStore::Check() {
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    StoreCheck check = CheckTree(s.Map());
+    StoreCheck check = CheckTree(s);
     if (s.options.cacheObjects > 0) {
         s.space->EvictCleanResidents(s.options.cacheObjects / 2);
     }

@@ -19,6 +19,7 @@
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
+#include "tnRuntime/LmdbStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnStore/CountingStore.h"
 #include "tnStore/Journal.h"
@@ -74,6 +75,7 @@ struct OffsetOpsStore::Impl {
     bool closed = false;
 
     std::shared_ptr<CountingStore> store;
+    LmdbStore* lmdb = nullptr;  // under `store`, for on-disk stores
     std::unique_ptr<CSpace> space;
     std::unique_ptr<SpaceRef<OffsetOps>> record;
     std::unique_ptr<Journal> journal;  // writers of on-disk stores
@@ -113,7 +115,8 @@ struct OffsetOpsStore::Impl {
 // The fewest objects an operation needs resident in a tree of `height`.
 ssize_t OperationHeadroom(ssize_t height);
 
-// The non-aborting tree check of `map`, as the API reports it.
-StoreCheck CheckTree(const FieldIdToOffsetOpsOnInt64FieldMap& map);
+// The non-aborting check of the store's tree, as the API reports it; within
+// the cache bound. Needs the space exclusively.
+StoreCheck CheckTree(OffsetOpsStore::Impl& s);
 
 }  // namespace tarn

@@ -9,6 +9,7 @@
 #include <new>
 #include <vector>
 
+#include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tools/Commands.h"
 
@@ -27,7 +28,7 @@ constexpr uint64 kMaxCacheNodes = 1'000'000'000;
 constexpr uint64 kMaxJournalMiB = uint64{1} << 20;
 constexpr uint64 kMaxLimit = INT64_MAX;
 
-const char* kCommands = "record, show, dump, validate, stats or clear";
+const char* kCommands = "record, show, export, diff, backup, dump, validate, stats or clear";
 
 const char* kOpsHelp =
     "operations to record, one a line: site,t,oid,path,offset (site a Guid "
@@ -165,6 +166,58 @@ UsageError Translate(const CLI::ParseError& e) {
     return {what, ""};
 }
 
+bool ProgressWanted(const Command& cmd) {
+    return !cmd.Flagged("--no-progress") && isatty(STDERR_FILENO) != 0;
+}
+
+WalkSettings WalkSettingsOf(const Command& cmd) {
+    WalkSettings settings;
+    settings.cacheObjects = static_cast<ssize_t>(cmd.Number(
+        "--cache-nodes", 0, kMaxCacheNodes, static_cast<uint64>(kDefaultWalkCacheObjects),
+        "0 (no bound) or a whole number up to " + std::to_string(kMaxCacheNodes)));
+    settings.progress = ProgressWanted(cmd);
+    return settings;
+}
+
+std::optional<FieldId> FieldOption(const Command& cmd, const std::string& name) {
+    const std::optional<std::string> text = cmd.Text(name);
+    if (!text) {
+        return std::nullopt;
+    }
+    std::string error;
+    std::optional<FieldId> field = ParseFieldId(*text, &error);
+    if (!field) {
+        throw UsageError{name + ": " + error};
+    }
+    return field;
+}
+
+ShowQuery ShowQueryOf(const Command& show) {
+    ShowQuery query;
+    query.field = FieldOption(show, "--field");
+    query.from = FieldOption(show, "--from");
+    query.to = FieldOption(show, "--to");
+    if (show.Has("--oid")) {
+        query.oid = OID(Seid(show.Number("--oid", 1, UINT64_MAX, 0)));
+    }
+    const int given =
+        (query.field ? 1 : 0) + (query.oid ? 1 : 0) + (query.from || query.to ? 1 : 0);
+    if (given > 1) {
+        throw UsageError{"show takes one of --field, --oid, or --from/--to", "show"};
+    }
+    if (query.from && query.to && CompareKeys(*query.from, *query.to) > 0) {
+        throw UsageError{"--from " + ToString(*query.from) + " comes after --to " +
+                         ToString(*query.to)};
+    }
+    if (show.Has("--limit")) {
+        if (query.field) {
+            throw UsageError{"--limit goes with a walk over several fields, not --field"};
+        }
+        query.limit = static_cast<int64>(show.Number("--limit", 0, kMaxLimit, 0));
+    }
+    return query;
+}
+
 }  // namespace
 
 int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostream& err) {
@@ -206,10 +259,42 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
                 "the latest ones)");
     record.Flag("--no-progress", "no progress line on a terminal");
 
-    Command show(app, "show", "print one field's table, or every field's in key order");
+    Command show(app, "show",
+                 "print one field's table, one object's, a range of fields', or every field's in "
+                 "key order");
     show.Option("--store", "DIR", "store directory");
     show.Option("--field", "OID/PATH", "only this field (e.g. #12/0a0b)");
+    show.Option("--oid", "N", "every field of object N");
+    show.Option("--from", "OID/PATH", "the fields from this one on, in key order");
+    show.Option("--to", "OID/PATH", "the fields up to and including this one");
     show.Option("--limit", "N", "print at most N fields, then how many there are");
+
+    const std::string walkCache = "keep at most C tree objects in memory (0: no bound; default " +
+                                  std::to_string(kDefaultWalkCacheObjects) + ")";
+    Command exportCmd(app, "export",
+                      "print every table as ops lines, which 'record --ops' loads back");
+    exportCmd.Option("--store", "DIR", "store directory");
+    exportCmd.Option("--out", "FILE",
+                     "write to FILE (made under a temporary name, then renamed) "
+                     "instead of standard output");
+    exportCmd.Option("--cache-nodes", "C", walkCache);
+    exportCmd.Flag("--no-progress", "no progress line on a terminal");
+
+    Command diff(app, "diff",
+                 "print the fields whose tables two stores do not agree on; exit status 0 when "
+                 "the maps are equal, 1 when they differ, 2 on errors");
+    diff.Option("--store", "A", "the first store's directory");
+    diff.Option("--with", "B", "the second store's directory");
+    diff.Option("--cache-nodes", "C", walkCache + ", per store");
+    diff.Flag("--no-progress", "no progress line on a terminal");
+
+    Command backup(app, "backup",
+                   "copy a store, consistent as of its latest durable point, beside a running "
+                   "record");
+    backup.Option("--store", "DIR", "the store to copy");
+    backup.Option("--to", "DIR", "the copy's directory: must not exist, or be empty");
+    backup.Flag("--compact", "leave out free pages: the copy is as small as its contents");
+    backup.Flag("--no-progress", "no progress line on a terminal");
     Command dump(app, "dump", "print the map's tree, node by node");
     Command validate(app, "validate",
                      "check the tree and the store; exit status 0 only when all holds");
@@ -239,7 +324,8 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
         if (app.get_subcommands().empty()) {
             throw UsageError{std::string("a command is needed: ") + kCommands, ""};
         }
-        for (const Command* cmd : {&record, &show, &dump, &validate, &stats, &clear}) {
+        for (const Command* cmd :
+             {&record, &show, &exportCmd, &diff, &backup, &dump, &validate, &stats, &clear}) {
             if (*cmd) {
                 cmd->RefuseExtras();
             }
@@ -293,19 +379,33 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
             return RunRecord(cmd, out, err);
         }
         if (show) {
-            const std::string store = show.Store();
-            std::optional<FieldId> field;
-            if (const std::optional<std::string> text = show.Text("--field")) {
-                std::string error;
-                field = ParseFieldId(*text, &error);
-                if (!field) {
-                    throw UsageError{error};
-                }
+            return RunShow(show.Store(), ShowQueryOf(show), out, err);
+        }
+        if (exportCmd) {
+            const std::string store = exportCmd.Store();
+            const std::string file = exportCmd.Text("--out").value_or("");
+            if (exportCmd.Has("--out") && file.empty()) {
+                throw UsageError{"--out needs a file name, or '-' for standard output"};
             }
-            const int64 limit = show.Has("--limit")
-                                    ? static_cast<int64>(show.Number("--limit", 0, kMaxLimit, 0))
-                                    : -1;
-            return RunShow(store, field, limit, out, err);
+            return RunExport(store, file, WalkSettingsOf(exportCmd), out, err);
+        }
+        if (diff) {
+            const std::string a = diff.Store();
+            const std::optional<std::string> b = diff.Text("--with");
+            if (!b || b->empty()) {
+                throw UsageError{"diff needs --with B, the directory of the store to compare with",
+                                 "diff"};
+            }
+            return RunDiff(a, *b, WalkSettingsOf(diff), out, err);
+        }
+        if (backup) {
+            const std::string store = backup.Store();
+            const std::optional<std::string> to = backup.Text("--to");
+            if (!to || to->empty()) {
+                throw UsageError{"backup needs --to DIR, the copy's directory", "backup"};
+            }
+            return RunBackup(store, *to, backup.Flagged("--compact"), ProgressWanted(backup), out,
+                             err);
         }
         if (dump) {
             return RunDump(dump.Store(), out, err);
@@ -326,7 +426,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
     } catch (const std::exception& e) {
         err << "offsetops: error: " << e.what() << '\n';
     }
-    return 1;
+    return diff ? 2 : 1;  // diff(1)'s convention: 1 means "they differ"
 }
 
 }  // namespace tarn::tool

@@ -10,9 +10,12 @@
 #include <map>
 #include <sstream>
 
+#include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/OstreamOutputStream.h"
 #include "tnUtils/xostream.h"
+#include "tools/CommandSupport.h"
 #include "tools/OpsFile.h"
+#include "tools/Progress.h"
 
 namespace tarn::tool {
 
@@ -20,47 +23,9 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-int Fail(std::ostream& err, const std::string& message) {
-    err << "offsetops: " << message << '\n';
-    return 1;
-}
-
-void Row(std::ostream& out, const char* label, const std::string& value) {
-    out << std::left << std::setw(22) << label << value << '\n';
-}
-
 std::string NodesText(const StoreStatistics& stats) {
     return std::to_string(stats.Nodes()) + " (" + std::to_string(stats.leaves) + " leaves, " +
            std::to_string(stats.internalNodes) + " internal)";
-}
-
-// Opens the store and says on `err` what opening repaired.
-OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostream& err) {
-    StoreOptions options;
-    options.mode = mode;
-    OffsetOpsStore store = OffsetOpsStore::Open(dir, options);
-    for (const std::string& repair : store.Repairs()) {
-        err << "offsetops: " << dir << ": repaired: " << repair << '\n';
-    }
-    return store;
-}
-
-// Refuses a tree that a walk over all of it could not take safely (the store
-// refuses to walk one too; this says so before anything changes).
-void RequireSoundTree(OffsetOpsStore& store) {
-    const StoreCheck check = store.Check();
-    if (!check.Ok()) {
-        throw RuntimeError(
-            "the stored tree is damaged (" + std::to_string(check.numProblems) +
-            " problems; the first: " + (check.problems.empty() ? "?" : check.problems.front()) +
-            "); run 'offsetops validate' for all");
-    }
-}
-
-std::string CacheTooSmall(ssize_t bound, ssize_t height) {
-    return "--cache-nodes " + std::to_string(bound) + " is too small: a tree of height " +
-           std::to_string(height) + " needs at least " +
-           std::to_string(OffsetOpsStore::MinCacheObjects(height)) + " objects in memory";
 }
 
 // For each site, the largest time stamp any field's table holds.
@@ -77,48 +42,6 @@ std::map<Guid, int64> LastStamps(OffsetOpsStore& store) {
     });
     return last;
 }
-
-// Progress on a terminal: one line, rewritten at most a few times a second.
-class Progress {
-public:
-    Progress(bool enabled, std::ostream& err, int64 total)
-        : m_enabled(enabled), m_err(err), m_total(total), m_start(Clock::now()) {}
-
-    void Update(int64 recorded, int64 durable) {
-        if (!m_enabled || (recorded & 1023) != 0) {
-            return;
-        }
-        const auto now = Clock::now();
-        if (now - m_last < std::chrono::milliseconds(250)) {
-            return;
-        }
-        m_last = now;
-        const double seconds = std::chrono::duration<double>(now - m_start).count();
-        m_err << "\r" << recorded;
-        if (m_total > 0) {
-            m_err << "/" << m_total;
-        }
-        m_err << " operations, " << durable << " durable, "
-              << static_cast<int64>(seconds > 0 ? recorded / seconds : 0) << " ops/s   "
-              << std::flush;
-        m_shown = true;
-    }
-
-    void Finish() {
-        if (m_shown) {
-            m_err << '\n';
-            m_shown = false;
-        }
-    }
-
-private:
-    bool m_enabled;
-    std::ostream& m_err;
-    int64 m_total;
-    Clock::time_point m_start;
-    Clock::time_point m_last{};
-    bool m_shown = false;
-};
 
 void Summary(std::ostream& out, const StoreStatistics& stats, int64 recorded, int64 durablePoints,
              ssize_t bound, double seconds) {
@@ -184,7 +107,7 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
         err << "offsetops: " << cmd.store << ": repaired: " << repair << '\n';
     }
     if (bound > 0) {
-        const ssize_t height = std::max<ssize_t>(store.Stats().height, 0);
+        const ssize_t height = std::max<ssize_t>(store.Height(), 0);
         if (bound < OffsetOpsStore::MinCacheObjects(height)) {
             store.Close();
             err << "offsetops: " << CacheTooSmall(bound, height) << '\n';
@@ -193,7 +116,15 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
     }
 
     const auto start = Clock::now();
-    Progress progress(cmd.progress, err, cmd.generate ? cmd.generate->count : 0);
+    // The share done: of the operations to generate, or of the ops file's
+    // bytes (unknown for a pipe).
+    ProgressLine progress(cmd.progress, err, "record");
+    uint64 sourceBytes = 0;
+    if (cmd.progress && in == &file) {
+        std::error_code ec;
+        const auto size = std::filesystem::file_size(cmd.opsFile, ec);
+        sourceBytes = ec ? 0 : static_cast<uint64>(size);
+    }
     int64 recorded = 0;       // operations of this run recorded
     int64 durable = 0;        // of those, durable
     int64 durablePoints = 0;  // reached by this run
@@ -236,7 +167,16 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
             sync();
         }
         inOperation = false;
-        progress.Update(recorded, durable);
+        if (progress.Enabled() && (recorded & 1023) == 0) {
+            const std::string text =
+                std::to_string(recorded) + " operations, " + std::to_string(durable) + " durable";
+            if (generator) {
+                progress.Show(static_cast<uint64>(recorded),
+                              static_cast<uint64>(cmd.generate->count), text);
+            } else {
+                progress.Show(reader->BytesRead(), sourceBytes, text);
+            }
+        }
         return true;
     };
     try {
@@ -282,7 +222,7 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
             // take the tree past the bound: like refused input, everything
             // before it is made durable. Say so in terms of the option.
             try {
-                const ssize_t height = store.Stats().height;
+                const ssize_t height = store.Height();
                 if (bound < OffsetOpsStore::MinCacheObjects(height)) {
                     const std::string where = position();
                     finishing = true;
@@ -306,31 +246,52 @@ int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err) {
     }
 }
 
-int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
-            std::ostream& out, std::ostream& err) {
+int RunShow(const std::string& store, const ShowQuery& query, std::ostream& out,
+            std::ostream& err) {
     OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
     OstreamOutputStream sink(out);
     xostream os(sink);
-    if (field) {
-        const std::optional<OffsetOpsOnField<int64>> table = opened.Find(*field);
+    if (query.field) {
+        const std::optional<OffsetOpsOnField<int64>> table = opened.Find(*query.field);
         if (!table) {
-            return Fail(err, "no offsets recorded for field " + ToString(*field));
+            return Fail(err, "no offsets recorded for field " + ToString(*query.field));
         }
-        os << *field << " --> " << *table << '\n';
+        os << *query.field << " --> " << *table << '\n';
         return 0;
     }
     int64 shown = 0;
-    opened.ForEach([&](const FieldId& key, const OffsetOpsOnField<int64>& table) {
-        if (shown == limit || !out) {
+    bool more = false;  // a field in range after the limit
+    const OffsetOpsStore::FieldVisitor print = [&](const FieldId& key,
+                                                   const OffsetOpsOnField<int64>& table) {
+        if (query.to && CompareKeys(key, *query.to) > 0) {
+            return false;
+        }
+        if (shown == query.limit) {
+            more = true;
             return false;
         }
         os << key << " --> " << table << '\n';
         ++shown;
-        return true;
-    });
-    const int64 size = opened.Size();
-    if (shown < size && out) {
-        os << "(" << shown << " of " << size << " fields shown)\n";
+        return static_cast<bool>(out);
+    };
+    if (query.oid) {
+        opened.ForEachOfObject(*query.oid, print);
+        if (shown == 0) {
+            return Fail(err, "no offsets recorded for object " + ToString(*query.oid));
+        }
+    } else {
+        opened.ForEachFrom(query.from.value_or(FieldId()), print);
+    }
+    if (!out) {
+        return 0;
+    }
+    if (!query.oid && !query.from && !query.to) {
+        const int64 size = opened.Size();
+        if (shown < size) {
+            os << "(" << shown << " of " << size << " fields shown)\n";
+        }
+    } else if (more) {
+        os << "(" << shown << " fields shown; more follow)\n";
     }
     return 0;
 }

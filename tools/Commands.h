@@ -49,12 +49,54 @@ struct RecordCommand {
 // with a summary on `out`.
 int RunRecord(const RecordCommand& cmd, std::ostream& out, std::ostream& err);
 
-// Every field's table in key order, one line each, or only `field`'s:
+// What `show` prints: one field, every field of one object, the fields of a
+// key range, or every field.
+struct ShowQuery {
+    std::optional<FieldId> field;  // only this field
+    std::optional<OID> oid;        // every field of this object
+    std::optional<FieldId> from;   // the fields from this one on ...
+    std::optional<FieldId> to;     // ... up to and including this one
+    int64 limit = -1;              // 0 or more: at most this many fields
+};
+
+// Tables in key order, one line each:
 //   #12/0a0b --> {(0123abcd-0000-4000-8000-00000000002a,(5,3)),...}
-// A field without a table is reported on `err` (status 1). A `limit` of 0 or
-// more prints at most that many fields and then how many there are.
-int RunShow(const std::string& store, const std::optional<FieldId>& field, int64 limit,
+// A field (or object) without a table is reported on `err` (status 1). With
+// a limit, the last line says how many fields there are (a whole walk) or
+// that more follow (a range).
+int RunShow(const std::string& store, const ShowQuery& query, std::ostream& out, std::ostream& err);
+
+// The walks over whole stores (export, diff) keep at most this many tree
+// objects in memory unless told otherwise.
+inline constexpr ssize_t kDefaultWalkCacheObjects = 4096;
+
+struct WalkSettings {
+    ssize_t cacheObjects = kDefaultWalkCacheObjects;  // 0: no bound
+    bool progress = false;                            // a progress line on `err`
+};
+
+// Every table as ops lines (site,t,oid,path,offset: fields in key order,
+// sites in table order) after a comment line, to `outFile` ("" or "-": to
+// `out`). Recorded into an empty store, they give equal tables. A file is
+// written under a temporary name and renamed when complete.
+int RunExport(const std::string& store, const std::string& outFile, const WalkSettings& settings,
+              std::ostream& out, std::ostream& err);
+
+// Compares the maps of stores `a` and `b` field by field in key order and
+// prints a line for each field that differs:
+//   < FIELD --> TABLE            only in a
+//   > FIELD --> TABLE            only in b
+//   ! FIELD --> TABLE_A TABLE_B  in both, with other tables
+// then a count. Status 0 when the maps are equal, 1 when they differ, 2 on
+// any error (diff(1)'s convention).
+int RunDiff(const std::string& a, const std::string& b, const WalkSettings& settings,
             std::ostream& out, std::ostream& err);
+
+// A consistent copy of `store` in the new or empty directory `to`, as of
+// the latest durable point, made beside a running writer; `compact` leaves
+// out free pages.
+int RunBackup(const std::string& store, const std::string& to, bool compact, bool progress,
+              std::ostream& out, std::ostream& err);
 
 // The tree, node by node.
 int RunDump(const std::string& store, std::ostream& out, std::ostream& err);

@@ -202,6 +202,7 @@ std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error) {
 OpsFileReader::Status OpsFileReader::Next(OffsetOperation& op, std::string& error) {
     while (std::getline(m_in, m_buffer)) {
         ++m_line;
+        m_bytes += m_buffer.size() + 1;
         std::string_view line = m_buffer;
         if (m_line == 1 && line.starts_with(kByteOrderMark)) {
             line.remove_prefix(kByteOrderMark.size());

@@ -74,12 +74,15 @@ public:
     // The number of the line read last (1 for the first line).
     int64 LineNumber() const { return m_line; }
     const std::string& Name() const { return m_name; }
+    // The bytes of the lines read so far, line breaks included.
+    uint64 BytesRead() const { return m_bytes; }
 
 private:
     std::istream& m_in;
     std::string m_name;
     std::string m_buffer;
     int64 m_line = 0;
+    uint64 m_bytes = 0;
 };
 
 }  // namespace tarn::tool

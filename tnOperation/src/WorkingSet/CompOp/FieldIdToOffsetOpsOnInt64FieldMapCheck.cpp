@@ -1,6 +1,8 @@
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 
+#include <optional>
 #include <unordered_set>
+#include <utility>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/RuntimeError.h"
@@ -19,19 +21,37 @@ std::string Name(const prefbase& ref) {
     return ToString(ref.m_oid);
 }
 
+std::string Name(uint64 oid) {
+    return "#" + std::to_string(oid);
+}
+
+// A reference that holds no pointer into the space: by identity, unless the
+// object has none yet (then it is not stored, and no eviction releases it).
+prefbase Detached(const prefbase& ref) {
+    return ref.m_oid.IsNull() ? ref : prefbase(ref.m_oid);
+}
+
 class Checker {
 public:
-    explicit Checker(TreeCheckResult& result) : m_result(result) {}
+    Checker(TreeCheckResult& result, const std::function<void()>& betweenNodes)
+        : m_result(result), m_betweenNodes(betweenNodes) {}
 
+    // Everything needed of the header is copied before the first node is
+    // loaded: the hook between nodes may release the header too.
     void Run(const Map& map) {
         CheckHeader(map);
-        if (map.m_height < 0 || !map.m_root) {
+        const ssize_t height = map.m_height;
+        const ssize_t size = map.m_size;
+        const prefbase root = Detached(map.m_root);
+        m_firstLeaf = map.m_firstLeaf.m_oid.value_;
+        m_lastLeaf = map.m_lastLeaf.m_oid.value_;
+        if (height < 0 || !root) {
             return;
         }
-        Node(map.m_height, map.m_root, true, nullptr, nullptr);
-        CheckChain(map);
-        if (m_result.entries != map.m_size) {  // invariant 7
-            Problem("the map's size is " + std::to_string(map.m_size) + " but its leaves hold " +
+        Node(height, root, true, nullptr, nullptr);
+        CheckChain();
+        if (m_result.entries != size) {  // invariant 7
+            Problem("the map's size is " + std::to_string(size) + " but its leaves hold " +
                     std::to_string(m_result.entries) + " entries");
         }
     }
@@ -40,6 +60,12 @@ private:
     void Problem(std::string text) {
         if (m_result.numProblems++ < TreeCheckResult::kMaxProblems) {
             m_result.problems.push_back(std::move(text));
+        }
+    }
+
+    void BetweenNodes() {
+        if (m_betweenNodes) {
+            m_betweenNodes();
         }
     }
 
@@ -82,7 +108,8 @@ private:
     }
 
     // Invariants 3, 4 and 5 for the subtree of `ref` at `height`, whose keys
-    // must lie in [lo, hi) (null: unbounded).
+    // must lie in [lo, hi) (null: unbounded). What the subtrees below need of
+    // the node is copied before they are checked.
     void Node(ssize_t height, const prefbase& ref, bool isRoot, const FieldId* lo,
               const FieldId* hi) {
         if (ref && !m_seen.insert(ref.m_oid.value_).second) {
@@ -93,26 +120,44 @@ private:
             Leaf(ref, isRoot, lo, hi);
             return;
         }
+        std::vector<FieldId> keys;
+        std::vector<prefbase> children;
+        if (!Internal(ref, isRoot, lo, hi, keys, children)) {
+            return;
+        }
+        BetweenNodes();
+        const std::size_t n = keys.size();
+        Node(height - 1, children[0], false, lo, &keys[0]);
+        for (std::size_t i = 0; i < n; ++i) {
+            Node(height - 1, children[i + 1], false, &keys[i], i + 1 < n ? &keys[i + 1] : hi);
+        }
+    }
+
+    // Checks one internal node and copies out its keys and its children
+    // (leftmost first); false when its subtrees cannot be checked.
+    bool Internal(const prefbase& ref, bool isRoot, const FieldId* lo, const FieldId* hi,
+                  std::vector<FieldId>& keys, std::vector<prefbase>& children) {
         auto* node = static_cast<InternalNode*>(
             Load(ref, GetReflectedClass<InternalNode>(), "internal node"));
         if (node == nullptr) {
-            return;
+            return false;
         }
         ++m_result.internalNodes;
         const ssize_t n = node->m_numKeyEntrys;
         const std::string name = "internal node " + Name(ref);
-        if (!CheckFill(name, n, isRoot ? 1 : 50)) {
-            return;
+        if (!CheckFill(name, n, isRoot ? 1 : 50) || n == 0) {
+            return false;
         }
+        keys.reserve(static_cast<std::size_t>(n));
+        children.reserve(static_cast<std::size_t>(n) + 1);
+        children.push_back(Detached(node->m_ptr));
         for (ssize_t i = 0; i < n; ++i) {
             CheckKey(name, i, node->GetEntry(i).m_key, i > 0 ? &node->GetEntry(i - 1).m_key : lo,
                      hi);
+            keys.push_back(node->GetEntry(i).m_key);
+            children.push_back(Detached(node->GetEntry(i).m_ptr));
         }
-        Node(height - 1, node->m_ptr, false, lo, &node->GetEntry(0).m_key);
-        for (ssize_t i = 0; i < n; ++i) {
-            Node(height - 1, node->GetEntry(i).m_ptr, false, &node->GetEntry(i).m_key,
-                 i + 1 < n ? &node->GetEntry(i + 1).m_key : hi);
-        }
+        return true;
     }
 
     void Leaf(const prefbase& ref, bool isRoot, const FieldId* lo, const FieldId* hi) {
@@ -131,7 +176,13 @@ private:
             CheckKey(name, i, leaf->GetEntry(i).first, i > 0 ? &leaf->GetEntry(i - 1).first : lo,
                      hi);
         }
-        m_leaves.push_back({leaf, ref.m_oid.value_});
+        LeafAt at{ref.m_oid.value_, leaf->m_prev.m_oid.value_, leaf->m_next.m_oid.value_,
+                  std::nullopt};
+        if (n > 0) {
+            at.keys.emplace(leaf->GetEntry(0).first, leaf->GetEntry(n - 1).first);
+        }
+        m_leaves.push_back(std::move(at));
+        BetweenNodes();
     }
 
     bool CheckFill(const std::string& name, ssize_t n, ssize_t least) {
@@ -160,59 +211,62 @@ private:
     }
 
     // Invariant 6, against the leaves in the order the tree holds them.
-    void CheckChain(const Map& map) {
+    void CheckChain() {
         if (m_leaves.empty()) {
             return;
         }
-        if (map.m_firstLeaf.m_oid.value_ != m_leaves.front().oid) {
-            Problem("the first leaf is " + Name(map.m_firstLeaf) + ", the tree's first leaf is #" +
-                    std::to_string(m_leaves.front().oid));
+        if (m_firstLeaf != m_leaves.front().oid) {
+            Problem("the first leaf is " + Name(m_firstLeaf) + ", the tree's first leaf is " +
+                    Name(m_leaves.front().oid));
         }
-        if (map.m_lastLeaf.m_oid.value_ != m_leaves.back().oid) {
-            Problem("the last leaf is " + Name(map.m_lastLeaf) + ", the tree's last leaf is #" +
-                    std::to_string(m_leaves.back().oid));
+        if (m_lastLeaf != m_leaves.back().oid) {
+            Problem("the last leaf is " + Name(m_lastLeaf) + ", the tree's last leaf is " +
+                    Name(m_leaves.back().oid));
         }
         for (std::size_t i = 0; i < m_leaves.size(); ++i) {
-            const LeafNode* leaf = m_leaves[i].leaf;
+            const LeafAt& leaf = m_leaves[i];
             const uint64 prev = i > 0 ? m_leaves[i - 1].oid : 0;
             const uint64 next = i + 1 < m_leaves.size() ? m_leaves[i + 1].oid : 0;
-            const std::string name = "leaf #" + std::to_string(m_leaves[i].oid);
-            if (leaf->m_prev.m_oid.value_ != prev) {
-                Problem(name + " links back to " + Name(leaf->m_prev) + ", not #" +
-                        std::to_string(prev));
+            const std::string name = "leaf " + Name(leaf.oid);
+            if (leaf.prev != prev) {
+                Problem(name + " links back to " + Name(leaf.prev) + ", not " + Name(prev));
             }
-            if (leaf->m_next.m_oid.value_ != next) {
-                Problem(name + " links on to " + Name(leaf->m_next) + ", not #" +
-                        std::to_string(next));
+            if (leaf.next != next) {
+                Problem(name + " links on to " + Name(leaf.next) + ", not " + Name(next));
             }
             if (i > 0) {
-                const LeafNode* before = m_leaves[i - 1].leaf;
-                if (before->m_numKeyEntrys > 0 && leaf->m_numKeyEntrys > 0 &&
-                    CompareKeys(before->GetEntry(before->m_numKeyEntrys - 1).first,
-                                leaf->GetEntry(0).first) >= 0) {
-                    Problem(name + " starts at " + ToString(leaf->GetEntry(0).first) +
+                const LeafAt& before = m_leaves[i - 1];
+                if (before.keys && leaf.keys &&
+                    CompareKeys(before.keys->second, leaf.keys->first) >= 0) {
+                    Problem(name + " starts at " + ToString(leaf.keys->first) +
                             ", not above the previous leaf's last key");
                 }
             }
         }
     }
 
+    // What the chain check needs of a leaf.
     struct LeafAt {
-        const LeafNode* leaf;
         uint64 oid;
+        uint64 prev;  // the identities its links hold (0: none)
+        uint64 next;
+        std::optional<std::pair<FieldId, FieldId>> keys;  // its first and last, unless empty
     };
 
     TreeCheckResult& m_result;
+    const std::function<void()>& m_betweenNodes;
+    uint64 m_firstLeaf = 0;  // the header's links
+    uint64 m_lastLeaf = 0;
     std::unordered_set<uint64> m_seen;
     std::vector<LeafAt> m_leaves;  // in tree order
 };
 
 }  // namespace
 
-TreeCheckResult FieldIdToOffsetOpsOnInt64FieldMapCheck(
-    const FieldIdToOffsetOpsOnInt64FieldMap& map) {
+TreeCheckResult FieldIdToOffsetOpsOnInt64FieldMapCheck(const FieldIdToOffsetOpsOnInt64FieldMap& map,
+                                                       const std::function<void()>& betweenNodes) {
     TreeCheckResult result;
-    Checker(result).Run(map);
+    Checker(result, betweenNodes).Run(map);
     return result;
 }
 

@@ -21,8 +21,13 @@
 //   7. m_size is the total of the leaves' entry counts
 //
 // Run it on the thread that holds the map's space (either lock). It loads the
-// whole tree and evicts nothing, so pointers to nodes stay valid throughout.
+// whole tree, node by node, and calls `betweenNodes` (if given) after each
+// node, at a moment when it holds no pointer into the tree: only identities
+// and copies of keys. The hook may therefore release clean residents, the
+// map's header included, so that the check stays within a bound of objects
+// in memory (the hook then needs the space exclusively).
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -44,6 +49,6 @@ struct FieldIdToOffsetOpsOnInt64FieldMapCheckResult {
 };
 
 FieldIdToOffsetOpsOnInt64FieldMapCheckResult FieldIdToOffsetOpsOnInt64FieldMapCheck(
-    const FieldIdToOffsetOpsOnInt64FieldMap& map);
+    const FieldIdToOffsetOpsOnInt64FieldMap& map, const std::function<void()>& betweenNodes = {});
 
 }  // namespace tarn

@@ -1,0 +1,318 @@
+// Backups: a consistent copy of an on-disk store, made beside its writer.
+//
+// A store is its data file (the tree as of the last checkpoint, with the
+// journal position that checkpoint covers) plus its journal (the durable
+// points after it). The writer checkpoints and starts a new journal at any
+// time, so the two are copied as a pair that belongs together:
+//   1. open the journal (a later checkpoint renames a new one over the name,
+//      but this descriptor keeps the file it opened);
+//   2. copy the data file; the copy holds one commit, as of some checkpoint
+//      P, which it names;
+//   3. scan the opened journal: when it begins at P, its complete records are
+//      the durable points after the copied checkpoint, and the copy gets
+//      them; when it ends at P, the checkpoint holds all of it (it has been
+//      replaced since), and the copy gets an empty journal that begins at P.
+//      Anything else means the writer checkpointed twice between 1 and 2, a
+//      moment apart: start again.
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <filesystem>
+#include <limits>
+#include <mutex>
+#include <thread>
+
+#include "tnRuntime/LmdbStore.h"
+#include "tnStore/OffsetOpsStore.h"
+#include "tnStore/StoreImpl.h"
+#include "tnUtils/UniqueFd.h"
+
+namespace tarn {
+
+namespace {
+
+namespace fs = std::filesystem;
+
+// Copies started again because the writer checkpointed twice as one began.
+constexpr int kBackupAttempts = 8;
+
+constexpr auto kProgressInterval = std::chrono::milliseconds(200);
+
+[[noreturn]] void IoFailure(const std::string& path, const char* doing, int error) {
+    throw RuntimeError(std::string(doing) + " '" + path + "': " +
+                       (error == ENOSPC || error == EDQUOT ? std::string("no space left on device")
+                                                           : std::strerror(error)));
+}
+
+void SyncPath(const std::string& path, int flags) {
+    UniqueFd fd(::open(path.c_str(), flags | O_CLOEXEC));
+    if (fd.Get() < 0 || ::fsync(fd.Get()) != 0) {
+        IoFailure(path, "syncing", errno);
+    }
+}
+
+// The target must be new or an empty directory; its parent is made if
+// missing.
+void RequireFreeTarget(const fs::path& to) {
+    std::error_code ec;
+    const fs::file_status status = fs::symlink_status(to, ec);
+    if (fs::exists(status)) {
+        if (!fs::is_directory(status)) {
+            throw RuntimeError("backup target '" + to.string() + "' exists and is not a directory");
+        }
+        if (!fs::is_empty(to, ec) || ec) {
+            throw RuntimeError("backup target '" + to.string() + "' exists and is not empty");
+        }
+    } else if (ec && ec != std::errc::no_such_file_or_directory) {
+        throw RuntimeError("backup target '" + to.string() + "': " + ec.message());
+    }
+    const fs::path parent = to.has_parent_path() ? to.parent_path() : fs::path(".");
+    fs::create_directories(parent, ec);
+    if (ec || !fs::is_directory(parent, ec)) {
+        throw RuntimeError("cannot make the directory '" + parent.string() + "': " + ec.message());
+    }
+}
+
+// A sibling of the target in which the copy is made; removed unless Keep().
+class PartialCopy {
+public:
+    explicit PartialCopy(const fs::path& to)
+        : m_path(to.parent_path() /
+                 ("." + to.filename().string() + ".backup-" + std::to_string(::getpid()))) {
+        std::error_code ec;
+        fs::remove_all(m_path, ec);  // left by an earlier run of this process id
+        if (!fs::create_directory(m_path, ec)) {
+            throw RuntimeError("cannot make the directory '" + m_path.string() +
+                               "': " + (ec ? ec.message() : std::string("it exists")));
+        }
+    }
+    ~PartialCopy() {
+        if (!m_kept) {
+            std::error_code ec;
+            fs::remove_all(m_path, ec);
+        }
+    }
+    PartialCopy(const PartialCopy&) = delete;
+    PartialCopy& operator=(const PartialCopy&) = delete;
+
+    const fs::path& Path() const { return m_path; }
+    // Renames the finished copy to `to` (over an empty directory there) and
+    // syncs both directories.
+    void MoveTo(const fs::path& to) {
+        SyncPath(m_path.string(), O_RDONLY | O_DIRECTORY);
+        if (::rename(m_path.c_str(), to.c_str()) != 0) {
+            const int error = errno;
+            if (error == ENOTEMPTY || error == EEXIST) {
+                throw RuntimeError("backup target '" + to.string() +
+                                   "' is no longer empty: something wrote into it meanwhile");
+            }
+            IoFailure(to.string(), "renaming the copy to", error);
+        }
+        m_kept = true;
+        const fs::path parent = to.has_parent_path() ? to.parent_path() : fs::path(".");
+        SyncPath(parent.string(), O_RDONLY | O_DIRECTORY);
+    }
+
+private:
+    fs::path m_path;
+    bool m_kept = false;
+};
+
+// Reports the growth of a file being written by someone else, from a thread
+// of its own, until destroyed.
+class FileGrowthReporter {
+public:
+    FileGrowthReporter(const BackupOptions::ProgressFn& report, std::string path, uint64 total)
+        : m_report(report), m_path(std::move(path)), m_total(total) {
+        if (m_report) {
+            m_thread = std::thread([this] { Run(); });
+        }
+    }
+    ~FileGrowthReporter() {
+        if (m_thread.joinable()) {
+            {
+                std::lock_guard lock(m_mutex);
+                m_done = true;
+            }
+            m_wake.notify_one();
+            m_thread.join();
+        }
+    }
+    FileGrowthReporter(const FileGrowthReporter&) = delete;
+    FileGrowthReporter& operator=(const FileGrowthReporter&) = delete;
+
+private:
+    void Run() {
+        std::unique_lock lock(m_mutex);
+        while (!m_wake.wait_for(lock, kProgressInterval, [this] { return m_done; })) {
+            struct stat st;
+            if (::stat(m_path.c_str(), &st) == 0) {
+                m_report(static_cast<uint64>(st.st_size), m_total);
+            }
+        }
+    }
+
+    const BackupOptions::ProgressFn& m_report;
+    std::string m_path;
+    uint64 m_total;
+    std::mutex m_mutex;
+    std::condition_variable m_wake;
+    bool m_done = false;
+    std::thread m_thread;
+};
+
+// Copies the first `bytes` bytes of the open file `fd` into a new file
+// `target`, synced.
+void CopyPrefix(int fd, const std::string& source, uint64 bytes, const std::string& target) {
+    UniqueFd out(::open(target.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
+    if (out.Get() < 0) {
+        IoFailure(target, "creating", errno);
+    }
+    std::vector<char> buffer(std::size_t{1} << 20);
+    for (uint64 at = 0; at < bytes;) {
+        const std::size_t want =
+            static_cast<std::size_t>(std::min<uint64>(buffer.size(), bytes - at));
+        const ssize_t got = ::pread(fd, buffer.data(), want, static_cast<off_t>(at));
+        if (got < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            IoFailure(source, "reading", errno);
+        }
+        if (got == 0) {
+            throw RuntimeError("journal '" + source + "' was cut while being copied");
+        }
+        for (ssize_t written = 0; written < got;) {
+            const ssize_t n = ::write(out.Get(), buffer.data() + written,
+                                      static_cast<std::size_t>(got - written));
+            if (n < 0) {
+                if (errno == EINTR) {
+                    continue;
+                }
+                IoFailure(target, "writing", errno);
+            }
+            written += n;
+        }
+        at += static_cast<uint64>(got);
+    }
+    if (::fsync(out.Get()) != 0) {
+        IoFailure(target, "syncing", errno);
+    }
+}
+
+int64 FileBytes(const fs::path& path) {
+    std::error_code ec;
+    const auto size = fs::file_size(path, ec);
+    return ec ? 0 : static_cast<int64>(size);
+}
+
+// The journal position the copied data file's checkpoint covers (0 when it
+// has none: a store made before journals). Opening the copy also checks its
+// data file as any opening does, and makes its lock file, whose absence a
+// later opening would report as a repair.
+uint64 CopiedCheckpoint(const fs::path& copy) {
+    LmdbStoreOptions options;
+    options.mode = OpenMode::ReadOnly;
+    std::unique_ptr<LmdbStore> copied = LmdbStore::Open(copy.string(), options);
+    return copied->FindCounter(kJournalPositionCounter).value_or(0);
+}
+
+// Copies the data file and the journal of the store in `dir` (whose data
+// file `lmdb` has open) into `copy`. False when the writer checkpointed
+// twice between opening the journal and starting the copy.
+bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
+             const BackupOptions& options, BackupResult& result) {
+    const std::string journalPath = (fs::path(dir) / Journal::kFileName).string();
+    std::error_code ec;
+    std::optional<UniqueFd> journal;
+    if (fs::exists(journalPath, ec) ||
+        lmdb.FindLatestCounter(kJournalPositionCounter).has_value()) {
+        journal.emplace(Journal::OpenForReading(journalPath));
+    }
+    const fs::path data = copy / "data.mdb";
+    const fs::path journalCopy = copy / Journal::kFileName;
+    for (const fs::path& stale : {data, copy / "lock.mdb", journalCopy}) {
+        fs::remove(stale, ec);
+    }
+    {
+        FileGrowthReporter reporter(options.progress, data.string(), lmdb.DataBytes());
+        lmdb.CopyTo(copy.string(), options.compact);
+    }
+    const uint64 checkpoint = CopiedCheckpoint(copy);
+    result.checkpointedOperations = checkpoint;
+    result.durableOperations = checkpoint;
+    result.dataBytes = FileBytes(data);
+    result.journalBytes = 0;
+    if (!journal) {
+        return true;  // a store made before journals: its data file is all of it
+    }
+    const JournalScan scan =
+        Journal::Scan(journal->Get(), journalPath, std::numeric_limits<uint64>::max(),
+                      [](uint64, const JournalEntry&) {});
+    if (scan.base == checkpoint) {
+        CopyPrefix(journal->Get(), journalPath, scan.validBytes, journalCopy.string());
+        result.durableOperations = scan.end;
+    } else if (scan.end == checkpoint) {
+        Journal::Reset(copy.string(), checkpoint, true);
+    } else {
+        return false;
+    }
+    result.journalBytes = FileBytes(journalCopy);
+    return true;
+}
+
+BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::string& to,
+                        const BackupOptions& options) {
+    if (to.empty()) {
+        throw RuntimeError("a backup needs a target directory");
+    }
+    // "b/" and "b/." name the directory b.
+    fs::path target = fs::path(to).lexically_normal();
+    if (target.filename().empty() && target.has_parent_path()) {
+        target = target.parent_path();
+    }
+    if (target.empty() || target == "." || target == "..") {
+        throw RuntimeError("backup target '" + to + "' exists and is not empty");
+    }
+    RequireFreeTarget(target);
+    PartialCopy copy(target);
+    BackupResult result;
+    for (int attempt = 1; !TryCopy(lmdb, dir, copy.Path(), options, result); ++attempt) {
+        if (attempt == kBackupAttempts) {
+            throw RuntimeError("store '" + dir +
+                               "' started a new journal twice at the start of "
+                               "each of " +
+                               std::to_string(kBackupAttempts) + " attempts to copy it; try again");
+        }
+    }
+    copy.MoveTo(target);
+    return result;
+}
+
+}  // namespace
+
+BackupResult OffsetOpsStore::Backup(const std::string& from, const std::string& to,
+                                    const BackupOptions& options) {
+    LmdbStoreOptions lmdbOptions;
+    lmdbOptions.mode = OpenMode::ReadOnly;
+    std::unique_ptr<LmdbStore> lmdb = LmdbStore::Open(from, lmdbOptions);
+    return BackupWith(*lmdb, from, to, options);
+}
+
+BackupResult OffsetOpsStore::Backup(const std::string& to, const BackupOptions& options) {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    if (s.lmdb == nullptr) {
+        throw RuntimeError("an in-memory store cannot be backed up");
+    }
+    return BackupWith(*s.lmdb, s.dir, to, options);
+}
+
+}  // namespace tarn

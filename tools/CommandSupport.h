@@ -1,0 +1,39 @@
+#pragma once
+
+// What the subcommands of `offsetops` share: messages, opening a store, and
+// the walks of the streaming commands.
+
+#include <ostream>
+#include <string>
+
+#include "tnStore/OffsetOpsStore.h"
+
+namespace tarn::tool {
+
+// Writes "offsetops: <message>" and returns 1.
+int Fail(std::ostream& err, const std::string& message);
+
+// "label                 value", the rows of the summaries.
+void Row(std::ostream& out, const char* label, const std::string& value);
+
+// Opens the store and says on `err` what opening repaired.
+OffsetOpsStore OpenAndReport(const std::string& dir, const StoreOptions& options,
+                             std::ostream& err);
+OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostream& err);
+
+// Refuses (RuntimeError) a tree that a walk over all of it could not take
+// safely; the store refuses to walk one too, this says so before anything
+// happens.
+void RequireSoundTree(OffsetOpsStore& store);
+
+// "--cache-nodes B is too small: a tree of height H needs at least N objects
+// in memory".
+std::string CacheTooSmall(ssize_t bound, ssize_t height);
+
+// Opens a store as a reader for a walk over all of it within `cacheObjects`
+// tree objects in memory (0: no bound), its tree checked. Returns nothing,
+// having said why on `err`, when the bound is too small for the tree.
+std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheObjects,
+                                          std::ostream& err);
+
+}  // namespace tarn::tool
