@@ -3,6 +3,7 @@
 // Helpers of the offsetops tests: scratch directories, running the program as
 // a child process, and a model of what a store should hold.
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/wait.h>
@@ -18,6 +19,7 @@
 #include <vector>
 
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
+#include "tools/Generator.h"
 #include "tools/OpsFile.h"
 
 namespace tarn::testing {
@@ -134,6 +136,55 @@ inline std::string ShowText(const Model& model) {
         }
         text += ToString(field) + " --> {" + table + "}\n";
     }
+    return text;
+}
+
+// The program's error report: one line, naming `part`.
+inline auto OneLineWith(const std::string& part) {
+    return ::testing::AllOf(::testing::MatchesRegex("offsetops: [^\n]*\n"),
+                            ::testing::HasSubstr(part));
+}
+
+// The value of a "label   value" row of the program's output.
+inline std::string RowValue(const std::string& out, const std::string& label) {
+    std::istringstream lines(out);
+    for (std::string line; std::getline(lines, line);) {
+        if (line.size() > label.size() && line.starts_with(label) && line[label.size()] == ' ') {
+            return line.substr(line.find_first_not_of(' ', label.size()));
+        }
+    }
+    return "";
+}
+
+// `model` after the operations of an ops text, read as the program reads a
+// file.
+inline Model ModelOf(const std::string& opsText, Model model = {}) {
+    std::istringstream in(opsText);
+    tool::OpsFileReader reader(in, "text");
+    std::string error;
+    for (tool::OffsetOperation op;
+         reader.Next(op, error) == tool::OpsFileReader::Status::Operation;) {
+        Apply(model, op);
+    }
+    return model;
+}
+
+// The generator's operations as an ops text, with comments and blank lines.
+inline std::string Generated(const tool::GeneratorSettings& settings, const Model& stored = {}) {
+    std::map<Guid, int64> last;  // each site's largest stored time stamp
+    for (const auto& [field, sites] : stored) {
+        for (const auto& [site, so] : sites) {
+            last[site] = std::max(last[site], so.t);
+        }
+    }
+    tool::Generator gen(settings, last);
+    std::string text = "# generated\n";
+    tool::OffsetOperation op;
+    std::string error;
+    while (gen.Next(op, error)) {
+        text += tool::FormatOpsLine(op) + (gen.Made() % 7 == 0 ? "  # seventh\n\n" : "\n");
+    }
+    EXPECT_EQ(error, "");
     return text;
 }
 

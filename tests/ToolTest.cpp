@@ -39,54 +39,6 @@ const std::string kSiteA = "00000000-0000-4000-8000-00000000000a";
 const std::string kSiteB = "00000000-0000-4000-8000-00000000000b";
 const std::string kBom = "\xEF\xBB\xBF";
 
-// The program's error report: one line, naming `part`.
-auto OneLineWith(const std::string& part) {
-    return ::testing::AllOf(::testing::MatchesRegex("offsetops: [^\n]*\n"), HasSubstr(part));
-}
-
-// The value of a "label   value" row of the program's output.
-std::string RowValue(const std::string& out, const std::string& label) {
-    std::istringstream lines(out);
-    for (std::string line; std::getline(lines, line);) {
-        if (line.size() > label.size() && line.starts_with(label) && line[label.size()] == ' ') {
-            return line.substr(line.find_first_not_of(' ', label.size()));
-        }
-    }
-    return "";
-}
-
-// `model` after the operations of an ops text, read as the program reads a
-// file.
-Model ModelOf(const std::string& opsText, Model model = {}) {
-    std::istringstream in(opsText);
-    tool::OpsFileReader reader(in, "text");
-    std::string error;
-    for (tool::OffsetOperation op;
-         reader.Next(op, error) == tool::OpsFileReader::Status::Operation;) {
-        Apply(model, op);
-    }
-    return model;
-}
-
-// The generator's operations as an ops text, with comments and blank lines.
-std::string Generated(const tool::GeneratorSettings& settings, const Model& stored = {}) {
-    std::map<Guid, int64> last;  // each site's largest stored time stamp
-    for (const auto& [field, sites] : stored) {
-        for (const auto& [site, so] : sites) {
-            last[site] = std::max(last[site], so.t);
-        }
-    }
-    Generator gen(settings, last);
-    std::string text = "# generated\n";
-    tool::OffsetOperation op;
-    std::string error;
-    while (gen.Next(op, error)) {
-        text += tool::FormatOpsLine(op) + (gen.Made() % 7 == 0 ? "  # seventh\n\n" : "\n");
-    }
-    EXPECT_EQ(error, "");
-    return text;
-}
-
 // ---------------------------------------------------------------------------
 
 TEST(OpsFileParsing, ReadsFieldsAroundBlanksAndCommentsAndSaysWhatIsWrongWithALine) {
