@@ -274,6 +274,17 @@ TEST_F(StoreDir, ACacheBoundKeepsTheSameTablesWithinTheBound) {
         EXPECT_GT(store.Stats().checkpoints, 1);
         EXPECT_EQ(AllTables(store), expected);
     }
+    {
+        // A reader checks and walks the whole tree within the bound too.
+        StoreOptions reading = bounded;
+        reading.mode = StoreMode::Read;
+        OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, reading);
+        EXPECT_TRUE(reader.Check().Ok());
+        EXPECT_EQ(AllTables(reader), expected);
+        const StoreStatistics stats = reader.Stats();
+        EXPECT_GT(stats.Nodes(), bounded.cacheObjects);
+        EXPECT_LE(stats.peakResidents, bounded.cacheObjects);
+    }
     OffsetOpsStore reopened = OffsetOpsStore::Open(m_dir, bounded);
     EXPECT_EQ(AllTables(reopened), expected);
     EXPECT_TRUE(reopened.Validate().Ok());
@@ -281,6 +292,47 @@ TEST_F(StoreDir, ACacheBoundKeepsTheSameTablesWithinTheBound) {
     tiny.cacheObjects = 5;
     EXPECT_THROW(OffsetOpsStore::Open(m_dir, tiny).Record(Opid(Site(1), 1 << 20), Field(1), 1),
                  RuntimeError);
+}
+
+// A backup holds the last durable point, whatever the writer recorded since,
+// and opens as a store of its own.
+TEST_F(StoreDir, BackupsHoldTheLastDurablePointAndOpenAsStores) {
+    const std::string copyDir = m_dir + "-copy", compactDir = m_dir + "-compact";
+    Tables durable;
+    {
+        OffsetOpsStore store = OffsetOpsStore::Open(m_dir);
+        store.Record(Opid(Site(1), 1), Field(1), 5);
+        store.Checkpoint();
+        store.Record(Opid(Site(1), 2), Field(2), 6);
+        store.Sync();
+        durable = AllTables(store);
+        store.Record(Opid(Site(1), 3), Field(3), 7);
+        const BackupResult copied = store.Backup(copyDir);
+        EXPECT_EQ(copied.checkpointedOperations, 1u);
+        EXPECT_EQ(copied.durableOperations, 2u);
+        // Open in this process: the store's own handle makes its backups.
+        EXPECT_THROW(OffsetOpsStore::Backup(m_dir, compactDir), RuntimeError);
+        EXPECT_FALSE(fs::exists(compactDir));
+    }
+    {
+        OffsetOpsStore copy = OffsetOpsStore::Open(copyDir, Reading());
+        EXPECT_EQ(AllTables(copy), durable);
+        EXPECT_TRUE(copy.Validate().Ok());
+        EXPECT_TRUE(copy.Repairs().empty());
+    }
+    BackupOptions compact;
+    compact.compact = true;
+    EXPECT_EQ(OffsetOpsStore::Backup(m_dir, compactDir, compact).durableOperations, 3u);
+    EXPECT_THAT([&] { OffsetOpsStore::Backup(m_dir, compactDir); },
+                ::testing::ThrowsMessage<RuntimeError>(HasSubstr("exists and is not empty")));
+    {
+        OffsetOpsStore copy = OffsetOpsStore::Open(compactDir);
+        copy.Record(Opid(Site(1), 4), Field(4), 8);
+        EXPECT_EQ(copy.Size(), 4);
+    }
+    EXPECT_THROW(OffsetOpsStore::OpenInMemory().Backup(m_dir + "-memory"), RuntimeError);
+    fs::remove_all(copyDir);
+    fs::remove_all(compactDir);
 }
 
 }  // namespace

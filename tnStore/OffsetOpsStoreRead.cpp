@@ -26,8 +26,11 @@ using Entry = std::pair<FieldId, OffsetOpsOnField<int64>>;
 
 StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
     const ssize_t bound = s.options.cacheObjects;
-    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result = FieldIdToOffsetOpsOnInt64FieldMapCheck(
-        s.Map(), [&] { KeepResidentsUnder(*s.space, bound); });
+    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result =
+        FieldIdToOffsetOpsOnInt64FieldMapCheck(s.Map(), [&] {
+            s.NotePeak();
+            KeepResidentsUnder(*s.space, bound);
+        });
     StoreCheck check;
     check.problems = std::move(result.problems);
     check.numProblems = result.numProblems;
