@@ -22,6 +22,7 @@ TEST(CrashTest, NeedsTheOpsFileReader) {
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <cstring>
@@ -105,6 +106,12 @@ Tables Model(int64 n) {
         }
         if (!error.empty()) {
             ::_exit(6);
+        }
+        // The whole file is durable: say so (the parent may be waiting for a
+        // first report), then wait for the kill.
+        const int64 durable = std::max(start, kFileOps);
+        if (::write(fd, &durable, sizeof durable) != sizeof durable) {
+            ::_exit(5);
         }
         ::pause();
         ::_exit(7);
