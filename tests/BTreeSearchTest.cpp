@@ -160,6 +160,16 @@ TEST_F(BTreeSearch, DamagedTreeStopsTheLookupThatWasCalled) {
             map().end();
         },
         m + "iterator " + m + "end()", "m_lastLeaf");
+    // The child index is the index of the search that fetches the child.
+    EXPECT_TARN_ASSERT_IN(
+        {
+            Root()->m_numKeyEntrys = 0;
+            Root()->FindChildIndexGivenKey(K(1));
+        },
+        "std::pair<void*, long int> "
+        "tarn::FieldIdToOffsetOpsOnInt64FieldMapInternalNode::FindChildGivenKey2" +
+            key + " const",
+        "1 <= nk && nk <= 100");
 }
 
 // The checker is what every tree test trusts; it must see each kind of damage.

@@ -146,8 +146,10 @@ public:
     // and its index: -1 for m_ptr, else the slot whose m_ptr it is.
     std::pair<void*, ssize_t> FindChildGivenKey2(const FieldId& key) const;
     void* FindChildGivenKey(const FieldId& key) const { return FindChildGivenKey2(key).first; }
-    // The index of FindChildGivenKey2 without fetching the child.
-    ssize_t FindChildIndexGivenKey(const FieldId& key) const;
+    // The index of FindChildGivenKey2; the child is fetched all the same.
+    ssize_t FindChildIndexGivenKey(const FieldId& key) const {
+        return FindChildGivenKey2(key).second;
+    }
 
     // Persistence (image layout in FieldIdToOffsetOpsOnInt64FieldMapPersist.cpp).
     void Serialise(Archive& ar) const;
