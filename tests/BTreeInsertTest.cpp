@@ -95,6 +95,34 @@ TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
     }
 }
 
+// A new root takes the split's separator entry by a raw swap. Keys (a long
+// one in a heap buffer) and references change places; the heap buffer itself
+// moves, so each key keeps one owner and is destroyed once, with its entry.
+using BTreeEntrySwap = testing::BTreeSpaceTest;
+
+TEST_F(BTreeEntrySwap, InternalEntriesExchangeKeysAndReferencesAsBytes) {
+    using Entry = FieldIdToOffsetOpsOnInt64FieldMapInternalKeyEntry;
+    Leaf* child[2] = {DollarNew(new Leaf()), DollarNew(new Leaf())};
+    const FieldId shortKey = testing::MakeKey(1);
+    const FieldId longKey = testing::MakeKey(2, true);
+    Entry a;
+    a.m_key = shortKey;
+    a.m_ptr = child[0];
+    Entry b;
+    b.m_key = longKey;
+    b.m_ptr = child[1];
+    const octet_t* heapBytes = b.m_key.path.data();
+    ASSERT_FALSE(b.m_key.path.IsLocal());
+
+    a.swap(b);
+    EXPECT_EQ(a.m_key, longKey);
+    EXPECT_EQ(a.m_key.path.data(), heapBytes);
+    EXPECT_EQ(a.m_ptr.Get(), static_cast<void*>(child[1]));
+    EXPECT_EQ(b.m_key, shortKey);
+    EXPECT_TRUE(b.m_key.path.IsLocal());
+    EXPECT_EQ(b.m_ptr.Get(), static_cast<void*>(child[0]));
+}
+
 // ---- Dirty marks and reachability per event ------------------------------------
 
 TEST_P(BTreeInsert, SplittingMiddleLeafRelinksItsSuccessor) {

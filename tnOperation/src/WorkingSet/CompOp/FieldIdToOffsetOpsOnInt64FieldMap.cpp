@@ -8,6 +8,7 @@
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/Assert.h"
+#include "tnUtils/MemSwap.h"
 
 namespace tarn {
 
@@ -35,8 +36,7 @@ inline void ConstructLeafEntry(LeafNode* leaf, ssize_t pos, const FieldId& key) 
 // Exchanges two values as raw bytes, without running their copy operations.
 template <typename T>
 inline void SwapRaw(T& a, T& b) {
-    FieldIdToOffsetOpsOnInt64FieldMapSwapBytes(static_cast<void*>(&a), static_cast<void*>(&b),
-                                               sizeof(T));
+    memswap(static_cast<void*>(&a), static_cast<void*>(&b), sizeof(T));
 }
 
 }  // namespace
