@@ -82,7 +82,7 @@ TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
         map().clear();
         Fill(1, 100);
         Leaf* left = map().m_firstLeaf.Get();
-        auto [it, created] = map().insert({Key(c.num), MakePayload(-1)});
+        auto [it, created] = testing::InsertEntry(map(), Key(c.num), MakePayload(-1));
         ASSERT_TRUE(created);
         Leaf* right = map().m_lastLeaf.Get();
         EXPECT_EQ(LeafCounts(map()), (std::vector<ssize_t>{50, 51}));
@@ -189,7 +189,7 @@ TEST_P(BTreeInsert, PresentKeysKeepOrReplaceTheirPayload) {
     Fill(1, 20);
     Leaf* leaf = LeafAt(0);
     Commit();
-    auto [it, created] = map().insert({K(6), MakePayload(99)});
+    auto [it, created] = testing::InsertEntry(map(), K(6), MakePayload(99));
     EXPECT_FALSE(created);
     EXPECT_EQ(it.policy().m_leaf, leaf);
     EXPECT_EQ(it.policy().m_offset, 5);

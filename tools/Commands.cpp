@@ -312,7 +312,7 @@ int RunShow(const std::string& store, const std::optional<FieldId>& field, int64
     OstreamOutputStream sink(out);
     xostream os(sink);
     if (field) {
-        const std::optional<OffsetOpsOnField<int64>> table = opened.Find(*field);
+        const std::unique_ptr<OffsetOpsOnField<int64>> table = opened.Find(*field);
         if (!table) {
             return Fail(err, "no offsets recorded for field " + ToString(*field));
         }

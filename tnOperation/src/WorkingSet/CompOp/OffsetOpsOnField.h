@@ -62,10 +62,9 @@ public:
     using MAP = RelocatableMap<std::map<Guid, SiteOffset<T>>>;
 
     OffsetOpsOnField() = default;
-    // A copy of the records that shares nothing with the source. The B+tree
-    // itself never copy-constructs a payload (it constructs one empty and
-    // assigns it); this exists for callers that hold tables by value.
-    OffsetOpsOnField(const OffsetOpsOnField& rhs) = default;
+    // No copy constructor: a table is made empty and then assigned, as the
+    // B+tree does with its payloads.
+    OffsetOpsOnField(const OffsetOpsOnField& rhs) = delete;
     ~OffsetOpsOnField() = default;
 
     // Builds the copy before releasing the old records; self-assignment safe.
