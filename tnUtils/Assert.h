@@ -6,7 +6,8 @@
 //
 // The source path is __FILE__, which the build maps to the repository root
 // (-fmacro-prefix-map), so that it reads "tnPersistStore/pref.h" wherever the
-// sources live.
+// sources live; the installed package passes the same mapping for its include
+// directory to the programs built against it.
 //
 // The function is named as the compiler prints it (__PRETTY_FUNCTION__), so
 // its spelling depends on the compiler. For the assignment of a pointer to an
