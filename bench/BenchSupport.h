@@ -12,9 +12,9 @@
 //   - std::map and std::unordered_map hold OffsetOpsOnField<int64> itself
 //     (node-based containers never move a value);
 //   - absl::btree_map moves values between slots on every insertion and
-//     split, and OffsetOpsOnField (one owning pointer, copyable but with no
-//     move constructor) would deep-copy each time; its peer payload is
-//     MovableTable, a plain movable std::map with the same Insert.
+//     split, which OffsetOpsOnField (one owning pointer, assignable but with
+//     neither a copy nor a move constructor) does not allow; its peer payload
+//     is MovableTable, a plain movable std::map with the same Insert.
 
 #include <algorithm>
 #include <cstdint>

@@ -25,6 +25,8 @@
 
 #include <memory>
 #include <string>
+#include <tuple>
+#include <utility>
 
 #include "bench/Subjects.h"
 #include "tnRuntime/MemoryStore.h"
@@ -187,7 +189,8 @@ public:
                 oid = (oid << 8) | k[b];
             }
             FieldId f(OID(Seid(oid)), Path(k + 8, static_cast<ssize_t>(kv.mv_size) - 8));
-            auto it = out.emplace_hint(out.end(), f, OffsetOpsOnField<int64>());
+            auto it = out.emplace_hint(out.end(), std::piecewise_construct,
+                                       std::forward_as_tuple(f), std::forward_as_tuple());
             InputArchive in(static_cast<const octet_t*>(vv.mv_data));
             in >> it->second;
         }

@@ -11,6 +11,7 @@
 #include <memory>
 #include <sstream>
 #include <string>
+#include <tuple>
 #include <utility>
 #include <vector>
 
@@ -59,11 +60,26 @@ inline Guid MakeSite(uint32 n) {
     return g;
 }
 
-// A table with one record from site `site`.
-inline OffsetOpsOnField<int64> MakePayload(int64 offset, uint32 site = 1, ssize_t t = 1) {
-    OffsetOpsOnField<int64> p;
-    p.Insert(MakeSite(site), t, offset);
-    return p;
+// A table with one record from site `site`. Tables have no copy
+// constructor, so a made table is handed out as a value of this type, filled
+// by its own constructor, and used wherever a table is read or assigned from.
+struct TestPayload : OffsetOpsOnField<int64> {
+    TestPayload(int64 offset, uint32 site, ssize_t t) { Insert(MakeSite(site), t, offset); }
+};
+
+inline TestPayload MakePayload(int64 offset, uint32 site = 1, ssize_t t = 1) {
+    return TestPayload(offset, site, t);
+}
+
+// The map's insert of (key, payload), which never overwrites. The entry is
+// made with an empty table, then assigned.
+inline std::pair<FieldIdToOffsetOpsOnInt64FieldMap::iterator, bool> InsertEntry(
+    FieldIdToOffsetOpsOnInt64FieldMap& map, const FieldId& key,
+    const OffsetOpsOnField<int64>& payload) {
+    FieldIdToOffsetOpsOnInt64FieldMap::value_type x(std::piecewise_construct,
+                                                    std::forward_as_tuple(key), std::tuple<>());
+    x.second = payload;
+    return map.insert(x);
 }
 
 inline std::string KeyText(const FieldId& k) {

@@ -47,13 +47,12 @@ protected:
         return MakeKey(1 + m_rng() % 3, path);
     }
 
-    Payload RandomPayload() {
-        Payload p;
+    // Records zero to two random offsets into the empty table `p`.
+    void FillRandomly(Payload& p) {
         for (uint64 s = m_rng() % 3; s > 0; --s) {
             p.Insert(MakeSite(static_cast<uint32>(m_rng() % 5)), m_time++,
                      static_cast<int64>(m_rng() % 1000) - 500);
         }
-        return p;
     }
 
     void CheckSame(const Map::const_iterator& it, Model::const_iterator mit, bool payload) {
@@ -80,7 +79,8 @@ protected:
 
     // Adds or replaces `key` in one of the three ways.
     void Grow(const FieldId& key) {
-        Payload p = RandomPayload();
+        Payload p;
+        FillRandomly(p);
         switch (m_rng() % 3) {
             case 0: {  // keyed access, then a change through the reference
                 Payload& q = m_model[key];
@@ -93,8 +93,11 @@ protected:
                 break;
             }
             case 1: {
-                auto [it, created] = map().insert({key, p});
-                auto [mit, mcreated] = m_model.insert({key, p});
+                auto [it, created] = testing::InsertEntry(map(), key, p);
+                auto [mit, mcreated] = m_model.try_emplace(key);
+                if (mcreated) {
+                    mit->second = p;
+                }
                 ASSERT_EQ(created, mcreated);
                 ASSERT_NO_FATAL_FAILURE(CheckSame(it, mit, true));
                 break;

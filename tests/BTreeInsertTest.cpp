@@ -82,7 +82,7 @@ TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
         map().clear();
         Fill(1, 100);
         Leaf* left = map().m_firstLeaf.Get();
-        auto [it, created] = map().insert({Key(c.num), MakePayload(-1)});
+        auto [it, created] = testing::InsertEntry(map(), Key(c.num), MakePayload(-1));
         ASSERT_TRUE(created);
         Leaf* right = map().m_lastLeaf.Get();
         EXPECT_EQ(LeafCounts(map()), (std::vector<ssize_t>{50, 51}));
@@ -93,6 +93,34 @@ TEST_P(BTreeInsert, NewKeyInFullLeafLandsAtItsSortedPlace) {
         EXPECT_EQ(Separators(Root()), Keys{testing::KeyNum(right->GetEntry(0).first)});
         EXPECT_BTREE_OK(map());
     }
+}
+
+// A new root takes the split's separator entry by a raw swap. Keys (a long
+// one in a heap buffer) and references change places; the heap buffer itself
+// moves, so each key keeps one owner and is destroyed once, with its entry.
+using BTreeEntrySwap = testing::BTreeSpaceTest;
+
+TEST_F(BTreeEntrySwap, InternalEntriesExchangeKeysAndReferencesAsBytes) {
+    using Entry = FieldIdToOffsetOpsOnInt64FieldMapInternalKeyEntry;
+    Leaf* child[2] = {DollarNew(new Leaf()), DollarNew(new Leaf())};
+    const FieldId shortKey = testing::MakeKey(1);
+    const FieldId longKey = testing::MakeKey(2, true);
+    Entry a;
+    a.m_key = shortKey;
+    a.m_ptr = child[0];
+    Entry b;
+    b.m_key = longKey;
+    b.m_ptr = child[1];
+    const octet_t* heapBytes = b.m_key.path.data();
+    ASSERT_FALSE(b.m_key.path.IsLocal());
+
+    a.swap(b);
+    EXPECT_EQ(a.m_key, longKey);
+    EXPECT_EQ(a.m_key.path.data(), heapBytes);
+    EXPECT_EQ(a.m_ptr.Get(), static_cast<void*>(child[1]));
+    EXPECT_EQ(b.m_key, shortKey);
+    EXPECT_TRUE(b.m_key.path.IsLocal());
+    EXPECT_EQ(b.m_ptr.Get(), static_cast<void*>(child[0]));
 }
 
 // ---- Dirty marks and reachability per event ------------------------------------
@@ -161,7 +189,7 @@ TEST_P(BTreeInsert, PresentKeysKeepOrReplaceTheirPayload) {
     Fill(1, 20);
     Leaf* leaf = LeafAt(0);
     Commit();
-    auto [it, created] = map().insert({K(6), MakePayload(99)});
+    auto [it, created] = testing::InsertEntry(map(), K(6), MakePayload(99));
     EXPECT_FALSE(created);
     EXPECT_EQ(it.policy().m_leaf, leaf);
     EXPECT_EQ(it.policy().m_offset, 5);

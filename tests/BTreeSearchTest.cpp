@@ -1,11 +1,13 @@
 // Lookups and iteration of the persistent B+tree map at the positions a
 // random walk rarely pins down exactly: empty maps, leaf boundaries,
-// separators, the position before the first entry, misuse of iterators. Also
-// checks that the shared tree checker notices broken invariants.
+// separators, the position before the first entry, misuse of iterators,
+// damaged trees. Also checks that the shared tree checker notices broken
+// invariants.
 
 #include <gtest/gtest.h>
 
 #include <functional>
+#include <string>
 #include <utility>
 
 #include "tests/AssertDeath.h"
@@ -103,6 +105,71 @@ TEST_F(BTreeSearch, OnlyMutableDereferenceMarksTheLeaf) {
     map().begin()->second.Insert(testing::MakeSite(3), 5, 1);
     EXPECT_TRUE(LeafAt(0)->IsDirty());
     EXPECT_FALSE(map().IsDirty());
+}
+
+// A tree whose header or nodes contradict each other stops the lookup that
+// met the damage, and the message names that lookup, const or not.
+TEST_F(BTreeSearch, DamagedTreeStopsTheLookupThatWasCalled) {
+    // The functions as GCC prints them.
+    const std::string m = "tarn::FieldIdToOffsetOpsOnInt64FieldMap::";
+    const std::string key = "(const tarn::FieldId&)";
+    const struct {
+        std::string function;
+        std::function<void()> call;
+    } lookups[] = {
+        {m + "const_iterator " + m + "find" + key + " const", [&] { cmap().find(K(1)); }},
+        {m + "iterator " + m + "find" + key, [&] { map().find(K(1)); }},
+        {m + "const_iterator " + m + "lower_bound" + key + " const",
+         [&] { cmap().lower_bound(K(1)); }},
+        {m + "iterator " + m + "lower_bound" + key, [&] { map().lower_bound(K(1)); }},
+        {m + "const_iterator " + m + "upper_bound" + key + " const",
+         [&] { cmap().upper_bound(K(1)); }},
+        {m + "iterator " + m + "upper_bound" + key, [&] { map().upper_bound(K(1)); }},
+        {"const tarn::OffsetOpsOnField<long int>* " + m + "rFind" + key + " const",
+         [&] { cmap().rFind(K(1)); }},
+    };
+    // A root but no height, and a height but no root.
+    Put(1 * kGap);
+    EXPECT_TARN_ASSERT_IN(
+        {
+            map().m_height = -1;
+            lookups[0].call();
+        },
+        lookups[0].function, "m_height >= 0");
+    EXPECT_TARN_ASSERT_IN(
+        {
+            map().m_root.Clear();
+            lookups[1].call();
+        },
+        lookups[1].function, "m_height == -1");
+    // K(1) lies under the root's leftmost child, whose reference is lost.
+    Fill(2, 101);
+    ASSERT_EQ(map().m_height, 1);
+    for (const auto& lookup : lookups) {
+        SCOPED_TRACE(lookup.function);
+        EXPECT_TARN_ASSERT_IN(
+            {
+                Root()->m_ptr.Clear();
+                lookup.call();
+            },
+            lookup.function, "node");
+    }
+    EXPECT_TARN_ASSERT_IN(
+        {
+            map().m_lastLeaf.Clear();
+            map().end();
+        },
+        m + "iterator " + m + "end()", "m_lastLeaf");
+    // The child index is the index of the search that fetches the child.
+    EXPECT_TARN_ASSERT_IN(
+        {
+            Root()->m_numKeyEntrys = 0;
+            Root()->FindChildIndexGivenKey(K(1));
+        },
+        "std::pair<void*, long int> "
+        "tarn::FieldIdToOffsetOpsOnInt64FieldMapInternalNode::FindChildGivenKey2" +
+            key + " const",
+        "1 <= nk && nk <= 100");
 }
 
 // The checker is what every tree test trusts; it must see each kind of damage.

@@ -82,7 +82,7 @@ TEST_F(OffsetOpsTest, RecordsSumPerSiteAndFieldAndClearStartsAfresh) {
     ASSERT_EQ(handle.size(), 2);
     EXPECT_EQ(handle.count(MakeKey(2)), 1);
     EXPECT_TRUE(handle.find(MakeKey(3)) == handle.end());
-    OffsetOpsOnField<int64> first = testing::MakePayload(6, 1, 5);  // offset, site, time
+    testing::TestPayload first = testing::MakePayload(6, 1, 5);  // offset, site, time
     first.Insert(MakeSite(2), 3, -7);
     EXPECT_EQ(*handle.find_2(MakeKey(1)), first);
     EXPECT_EQ(*handle.find_2(MakeKey(2)), testing::MakePayload(0, 1, 9));

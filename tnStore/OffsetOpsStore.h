@@ -7,7 +7,7 @@
 //   OffsetOpsStore store = OffsetOpsStore::Open("store");   // a directory
 //   store.Record(Opid(site, 7), FieldId(OID(Seid(uint64{42})), Path("\x01", 1)), 12);
 //   store.Sync();                                            // durable from here on
-//   std::optional<OffsetOpsOnField<int64>> table = store.Find(field);
+//   std::unique_ptr<OffsetOpsOnField<int64>> table = store.Find(field);
 //   store.Close();
 //
 // Handles. An OffsetOpsStore owns everything it opened (the object space, the
@@ -206,8 +206,9 @@ public:
 
     // --- Reading (any handle) ---------------------------------------------------
 
-    // A copy of the table of `field`, or nothing.
-    std::optional<OffsetOpsOnField<int64>> Find(const FieldId& field);
+    // A copy of the table of `field`, or null. (Tables are assigned, never
+    // copy-constructed, so the copy is handed out on the heap.)
+    std::unique_ptr<OffsetOpsOnField<int64>> Find(const FieldId& field);
     // Calls `fn` for every field from the first not less than `from`, in key
     // order, until it returns false.
     using FieldVisitor = std::function<bool(const FieldId&, const OffsetOpsOnField<int64>&)>;

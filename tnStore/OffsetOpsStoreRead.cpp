@@ -1,6 +1,9 @@
 // The reading half of the API: lookups, ordered walks, statistics, checks
 // and the dump.
 
+#include <deque>
+#include <memory>
+#include <tuple>
 #include <utility>
 
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
@@ -37,7 +40,7 @@ StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
     return check;
 }
 
-std::optional<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field) {
+std::unique_ptr<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field) {
     Impl& s = *m_impl;
     s.RequireOpen();
     s.RequireSoundTree();
@@ -45,17 +48,20 @@ std::optional<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field
     s.MakeRoom();
     const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
     if (table == nullptr) {
-        return std::nullopt;
+        return nullptr;
     }
-    return *table;
+    auto copy = std::make_unique<OffsetOpsOnField<int64>>();
+    *copy = *table;
+    return copy;
 }
 
 void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
     Impl& s = *m_impl;
     s.RequireOpen();
     s.RequireSoundTree();
-    std::vector<Entry> batch;
-    batch.reserve(kWalkBatch);
+    // A deque, since a table can be assigned but not copy-constructed into
+    // a growing vector.
+    std::deque<Entry> batch;
     FieldId key = from;
     bool inclusive = true;
     for (;;) {
@@ -66,7 +72,9 @@ void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
             const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
             auto it = inclusive ? map.lower_bound(key) : map.upper_bound(key);
             for (; it != map.end() && batch.size() < kWalkBatch; ++it) {
-                batch.emplace_back(it->first, it->second);
+                batch.emplace_back(std::piecewise_construct, std::forward_as_tuple(it->first),
+                                   std::forward_as_tuple());
+                batch.back().second = it->second;
             }
         }
         for (const Entry& e : batch) {

@@ -2,10 +2,30 @@
 
 // The one assertion of the code base. A failed check writes
 //   <source path>:<line>: <function signature>: Assertion "<expression>" failed.
-// to standard error and aborts. The expression text is the stringified source
-// expression, so checks whose text is part of the system's contract must be
-// written exactly as that text reads (and kept away from the formatter with
-// "clang-format off" where it would insert spaces).
+// to standard error and aborts.
+//
+// The source path is __FILE__, which the build maps to the repository root
+// (-fmacro-prefix-map), so that it reads "tnPersistStore/pref.h" wherever the
+// sources live; the installed package passes the same mapping for its include
+// directory to the programs built against it.
+//
+// The function is named as the compiler prints it (__PRETTY_FUNCTION__), so
+// its spelling depends on the compiler. For the assignment of a pointer to an
+// untyped persistent reference, GCC prints
+//   tarn::cref<void>& tarn::cref<void>::operator=(void*)
+// Clang prints
+//   tarn::cref<void> &tarn::cref<void>::operator=(void *)
+// and the texts the system documents use the same spacing with an unqualified
+// return type:
+//   cref<void> &tarn::cref<void>::operator=(void *)
+// In a member of a class template GCC names the template and appends the
+// arguments, e.g. "T* tarn::cref<T>::GetNotNull() const [with T = tarn::X]".
+//
+// The expression text is the stringified source expression, so checks whose
+// text is part of the system's contract must be written exactly as that text
+// reads. The repository's .clang-format lists TARN_ASSERT among its
+// whitespace-sensitive macros, so the formatter leaves the spacing inside the
+// parentheses as written.
 //
 // Checks are always on: they guard the persistent tree against corrupt or
 // inconsistent state, and a release build must not silently continue past one.

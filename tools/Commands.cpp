@@ -252,7 +252,7 @@ int RunShow(const std::string& store, const ShowQuery& query, std::ostream& out,
     OstreamOutputStream sink(out);
     xostream os(sink);
     if (query.field) {
-        const std::optional<OffsetOpsOnField<int64>> table = opened.Find(*query.field);
+        const std::unique_ptr<OffsetOpsOnField<int64>> table = opened.Find(*query.field);
         if (!table) {
             return Fail(err, "no offsets recorded for field " + ToString(*query.field));
         }

@@ -1,7 +1,7 @@
 // offsetops diff: the fields whose tables two stores do not agree on.
 
 #include <filesystem>
-#include <vector>
+#include <deque>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/OstreamOutputStream.h"
@@ -55,7 +55,8 @@ private:
     }
 
     OffsetOpsStore& m_store;
-    std::vector<std::pair<FieldId, OffsetOpsOnField<int64>>> m_batch;
+    // A deque: its elements never move, and tables are not copy-constructed.
+    std::deque<std::pair<FieldId, OffsetOpsOnField<int64>>> m_batch;
     std::size_t m_at = 0;
 };
 

@@ -6,6 +6,9 @@
 
 namespace tarn {
 
-using Opid = TOpid<Guid, int64>;
+// The sequence number of an operation within its site's history.
+using GenSeqNum = int64;
+
+using Opid = TOpid<SiteNum, GenSeqNum>;
 
 }  // namespace tarn

@@ -8,6 +8,7 @@
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/Assert.h"
+#include "tnUtils/MemSwap.h"
 
 namespace tarn {
 
@@ -35,8 +36,7 @@ inline void ConstructLeafEntry(LeafNode* leaf, ssize_t pos, const FieldId& key) 
 // Exchanges two values as raw bytes, without running their copy operations.
 template <typename T>
 inline void SwapRaw(T& a, T& b) {
-    FieldIdToOffsetOpsOnInt64FieldMapSwapBytes(static_cast<void*>(&a), static_cast<void*>(&b),
-                                               sizeof(T));
+    memswap(static_cast<void*>(&a), static_cast<void*>(&b), sizeof(T));
 }
 
 }  // namespace
@@ -68,9 +68,7 @@ Map::~FieldIdToOffsetOpsOnInt64FieldMap() = default;
 ssize_t Map::SearchLeaf(const FieldId& key, LeafNode* leaf) const {
     TARN_ASSERT(leaf);
     ssize_t nk = leaf->m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(0 <= nk && nk <= 100);
-    // clang-format on
     ssize_t lo = 0;
     ssize_t hi = nk - 1;
     while (lo <= hi) {
@@ -90,16 +88,12 @@ ssize_t Map::SearchLeaf(const FieldId& key, LeafNode* leaf) const {
 ssize_t Map::LowerBoundInLeaf(const FieldId& key, LeafNode* leaf) const {
     TARN_ASSERT(leaf);
     ssize_t nk = leaf->m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(0 <= nk && nk <= 100);
-    // clang-format on
     ssize_t lo = 0;
     ssize_t hi = nk;
     while (lo < hi) {
         ssize_t mid = (lo + hi) / 2;
-        // clang-format off
         TARN_ASSERT(0 <= mid && mid < nk);
-        // clang-format on
         if (CompareKeys(key, leaf->GetEntry(mid).first) <= 0) {
             hi = mid;
         } else {
@@ -107,25 +101,19 @@ ssize_t Map::LowerBoundInLeaf(const FieldId& key, LeafNode* leaf) const {
         }
     }
     TARN_ASSERT(lo == hi);
-    // clang-format off
     TARN_ASSERT(0 <= hi && hi <= nk);
-    // clang-format on
     return hi;
 }
 
 ssize_t Map::UpperBoundInLeaf(const FieldId& key, LeafNode* leaf) const {
     TARN_ASSERT(leaf);
     ssize_t nk = leaf->m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(0 <= nk && nk <= 100);
-    // clang-format on
     ssize_t lo = 0;
     ssize_t hi = nk;
     while (lo < hi) {
         ssize_t mid = (lo + hi) / 2;
-        // clang-format off
         TARN_ASSERT(0 <= mid && mid < nk);
-        // clang-format on
         if (CompareKeys(key, leaf->GetEntry(mid).first) < 0) {
             hi = mid;
         } else {
@@ -133,96 +121,96 @@ ssize_t Map::UpperBoundInLeaf(const FieldId& key, LeafNode* leaf) const {
         }
     }
     TARN_ASSERT(lo == hi);
-    // clang-format off
     TARN_ASSERT(0 <= hi && hi <= nk);
-    // clang-format on
     return hi;
 }
 
-// Descends from the root to the leaf whose key range holds `key`.
-LeafNode* Map::FindLeaf(const FieldId& key) const {
-    void* node = m_root.Get();
-    if (!node) {
-        TARN_ASSERT(m_height == -1);
-        return nullptr;
+// The descent shared by the lookups: from the root to the leaf whose key
+// range holds `key`, leaving that leaf in `node`. A map without a root
+// returns `emptyAnswer` at once. It is a macro, expanded into each lookup, so
+// that a failed check names the lookup that was called.
+#define FIELD_ID_MAP_DESCEND_TO_LEAF(emptyAnswer)        \
+    void* node = m_root.Get();                           \
+    if (!node) {                                         \
+        TARN_ASSERT(m_height == -1);                     \
+        return emptyAnswer;                              \
+    }                                                    \
+    TARN_ASSERT(m_height >= 0);                          \
+    for (ssize_t h = m_height; h > 0; --h) {             \
+        node = AsInternal(node)->FindChildGivenKey(key); \
+        TARN_ASSERT(node);                               \
     }
-    TARN_ASSERT(m_height >= 0);
-    for (ssize_t h = m_height; h > 0; --h) {
-        node = AsInternal(node)->FindChildGivenKey(key);
-        TARN_ASSERT(node);
+
+namespace {
+
+// The position of slot `j` of `leaf` as a bound. Slot j == count of a leaf
+// other than the last is not a position: the bound is the next leaf's first
+// entry.
+Map::IteratorPolicy BoundPosition(LeafNode* leaf, ssize_t j) {
+    if (j == leaf->m_numKeyEntrys && leaf->m_next) {
+        return Map::IteratorPolicy(leaf->m_next.Get(), 0);
     }
-    return AsLeaf(node);
+    return Map::IteratorPolicy(leaf, j);
 }
+
+}  // namespace
 
 Map::const_iterator Map::find(const FieldId& key) const {
-    LeafNode* leaf = FindLeaf(key);
-    if (!leaf) {
-        return const_iterator(IteratorPolicy(nullptr, 0));
-    }
-    ssize_t j = SearchLeaf(key, leaf);
-    if (j != -1) {
-        return const_iterator(IteratorPolicy(leaf, j));
-    }
-    return end();
-}
-
-const OffsetOpsOnField<int64>* Map::rFind(const FieldId& key) const {
-    LeafNode* leaf = FindLeaf(key);
-    if (!leaf) {
-        return nullptr;
-    }
-    ssize_t j = SearchLeaf(key, leaf);
-    return j != -1 ? &leaf->GetEntry(j).second : nullptr;
-}
-
-Map::const_iterator Map::lower_bound(const FieldId& key) const {
-    void* node = FindLeaf(key);
-    if (!node) {
-        return const_iterator(IteratorPolicy(nullptr, 0));
-    }
-    ssize_t j = LowerBoundInLeaf(key, AsLeaf(node));
-    // clang-format off
-    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
-    // clang-format on
-    LeafNode* leaf = AsLeaf(node);
-    if (j == leaf->m_numKeyEntrys && leaf->m_next) {
-        return const_iterator(IteratorPolicy(leaf->m_next.Get(), 0));
-    }
-    return const_iterator(IteratorPolicy(leaf, j));
-}
-
-Map::const_iterator Map::upper_bound(const FieldId& key) const {
-    void* node = FindLeaf(key);
-    if (!node) {
-        return const_iterator(IteratorPolicy(nullptr, 0));
-    }
-    ssize_t j = UpperBoundInLeaf(key, AsLeaf(node));
-    // clang-format off
-    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
-    // clang-format on
-    LeafNode* leaf = AsLeaf(node);
-    if (j == leaf->m_numKeyEntrys && leaf->m_next) {
-        return const_iterator(IteratorPolicy(leaf->m_next.Get(), 0));
-    }
-    return const_iterator(IteratorPolicy(leaf, j));
+    FIELD_ID_MAP_DESCEND_TO_LEAF(const_iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = SearchLeaf(key, AsLeaf(node));
+    return j != -1 ? const_iterator(IteratorPolicy(AsLeaf(node), j)) : end();
 }
 
 Map::iterator Map::find(const FieldId& key) {
-    return iterator(static_cast<const Map*>(this)->find(key).policy());
+    FIELD_ID_MAP_DESCEND_TO_LEAF(iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = SearchLeaf(key, AsLeaf(node));
+    return j != -1 ? iterator(IteratorPolicy(AsLeaf(node), j)) : end();
+}
+
+const OffsetOpsOnField<int64>* Map::rFind(const FieldId& key) const {
+    FIELD_ID_MAP_DESCEND_TO_LEAF(nullptr);
+    ssize_t j = SearchLeaf(key, AsLeaf(node));
+    return j != -1 ? &AsLeaf(node)->GetEntry(j).second : nullptr;
+}
+
+Map::const_iterator Map::lower_bound(const FieldId& key) const {
+    FIELD_ID_MAP_DESCEND_TO_LEAF(const_iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = LowerBoundInLeaf(key, AsLeaf(node));
+    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
+    return const_iterator(BoundPosition(AsLeaf(node), j));
 }
 
 Map::iterator Map::lower_bound(const FieldId& key) {
-    return iterator(static_cast<const Map*>(this)->lower_bound(key).policy());
+    FIELD_ID_MAP_DESCEND_TO_LEAF(iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = LowerBoundInLeaf(key, AsLeaf(node));
+    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
+    return iterator(BoundPosition(AsLeaf(node), j));
+}
+
+Map::const_iterator Map::upper_bound(const FieldId& key) const {
+    FIELD_ID_MAP_DESCEND_TO_LEAF(const_iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = UpperBoundInLeaf(key, AsLeaf(node));
+    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
+    return const_iterator(BoundPosition(AsLeaf(node), j));
 }
 
 Map::iterator Map::upper_bound(const FieldId& key) {
-    return iterator(static_cast<const Map*>(this)->upper_bound(key).policy());
+    FIELD_ID_MAP_DESCEND_TO_LEAF(iterator(IteratorPolicy(nullptr, 0)));
+    ssize_t j = UpperBoundInLeaf(key, AsLeaf(node));
+    TARN_ASSERT(0 <= j && j <= FieldIdToOffsetOpsOnInt64FieldMapAsLeafNode(node)->m_numKeyEntrys);
+    return iterator(BoundPosition(AsLeaf(node), j));
 }
+
+#undef FIELD_ID_MAP_DESCEND_TO_LEAF
 
 // ---- Iteration ------------------------------------------------------------------
 
 Map::const_iterator Map::begin() const {
     return const_iterator(IteratorPolicy(m_firstLeaf.Get(), 0));
+}
+
+Map::iterator Map::begin() {
+    return iterator(IteratorPolicy(m_firstLeaf.Get(), 0));
 }
 
 Map::const_iterator Map::end() const {
@@ -234,12 +222,13 @@ Map::const_iterator Map::end() const {
     return const_iterator(IteratorPolicy(nullptr, 0));
 }
 
-Map::iterator Map::begin() {
-    return iterator(static_cast<const Map*>(this)->begin().policy());
-}
-
 Map::iterator Map::end() {
-    return iterator(static_cast<const Map*>(this)->end().policy());
+    if (m_height >= 0) {
+        TARN_ASSERT(m_lastLeaf);
+        LeafNode* last = m_lastLeaf.Get();
+        return iterator(IteratorPolicy(last, last->m_numKeyEntrys));
+    }
+    return iterator(IteratorPolicy(nullptr, 0));
 }
 
 // ---- Write-find -------------------------------------------------------------------
@@ -310,18 +299,14 @@ void Map::wRecursiveFind(wFindRet& ret, InternalNode* left, ssize_t height, cons
 LeafNode* Map::wFindInLeaf(wFindRet& ret, LeafNode* left, const FieldId& key, bool allowCreate) {
     TARN_ASSERT(left);
     ssize_t nk = left->m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(0 <= nk && nk <= 100);
-    // clang-format on
 
     // 1. Binary search; a present key is reported whatever allowCreate says.
     ssize_t lo = 0;
     ssize_t hi = nk - 1;
     while (lo <= hi) {
         ssize_t mid = (lo + hi) / 2;
-        // clang-format off
         TARN_ASSERT(0 <= mid && mid < nk);
-        // clang-format on
         int c = CompareKeys(key, left->GetEntry(mid).first);
         if (c > 0) {
             lo = mid + 1;
@@ -352,9 +337,7 @@ LeafNode* Map::wFindInLeaf(wFindRet& ret, LeafNode* left, const FieldId& key, bo
     ret.m_created = true;
     ++m_size;
     MarkAsDirtyWithoutTrace();
-    // clang-format off
     TARN_ASSERT(0 <= insertPos && insertPos <= nk);
-    // clang-format on
 
     // 4. Room in the leaf: open the slot.
     if (nk != 100) {
@@ -418,18 +401,14 @@ void Map::InsertIntoInternalNode(InternalNode* left, const InternalKeyEntry& e,
                                  InternalKeyEntry& overflow) {
     TARN_ASSERT(left);
     ssize_t nk = left->m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(1 <= nk && nk <= 100);
-    // clang-format on
 
     // 1. Position of the new separator.
     ssize_t lo = 0;
     ssize_t hi = nk - 1;
     while (lo <= hi) {
         ssize_t mid = (lo + hi) / 2;
-        // clang-format off
         TARN_ASSERT(0 <= mid && mid < nk);
-        // clang-format on
         int c = CompareKeys(e.m_key, left->GetEntry(mid).m_key);
         TARN_ASSERT(c != 0);
         if (c < 0) {
@@ -438,13 +417,9 @@ void Map::InsertIntoInternalNode(InternalNode* left, const InternalKeyEntry& e,
             lo = mid + 1;
         }
     }
-    // clang-format off
     TARN_ASSERT(lo == hi+1);
-    // clang-format on
     ssize_t insertPos = lo;
-    // clang-format off
     TARN_ASSERT(0 <= insertPos && insertPos <= nk);
-    // clang-format on
 
     if (nk != 100) {
         // 2. Room: open the slot.

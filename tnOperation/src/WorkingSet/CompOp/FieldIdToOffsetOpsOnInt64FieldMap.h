@@ -73,9 +73,7 @@ public:
 
         void next() {
             TARN_ASSERT(m_leaf);
-            // clang-format off
             TARN_ASSERT(-1 <= m_offset && m_offset < m_leaf->m_numKeyEntrys);
-            // clang-format on
             ++m_offset;
             if (m_offset == m_leaf->m_numKeyEntrys && m_leaf->m_next) {
                 m_leaf = m_leaf->m_next.Get();
@@ -85,9 +83,7 @@ public:
 
         void prev() {
             TARN_ASSERT(m_leaf);
-            // clang-format off
             TARN_ASSERT(0 <= m_offset && m_offset <= m_leaf->m_numKeyEntrys);
-            // clang-format on
             --m_offset;
             if (m_offset < 0 && m_leaf->m_prev) {
                 m_leaf = m_leaf->m_prev.Get();
@@ -98,18 +94,14 @@ public:
         // The entry, for change: marks its leaf dirty.
         value_type& deref() const {
             TARN_ASSERT(m_leaf);
-            // clang-format off
             TARN_ASSERT(0 <= m_offset && m_offset < m_leaf->m_numKeyEntrys);
-            // clang-format on
             m_leaf->MarkAsDirtyWithoutTrace();
             return reinterpret_cast<value_type&>(m_leaf->GetEntry(m_offset));
         }
 
         const value_type& const_deref() const {
             TARN_ASSERT(m_leaf);
-            // clang-format off
             TARN_ASSERT(0 <= m_offset && m_offset < m_leaf->m_numKeyEntrys);
-            // clang-format on
             return reinterpret_cast<const value_type&>(m_leaf->GetEntry(m_offset));
         }
 
@@ -222,9 +214,6 @@ public:
     ssize_t m_height;
 
 private:
-    // The leaf whose key range holds `key`, or null for a map without root.
-    LeafNode* FindLeaf(const FieldId& key) const;
-
     void wFindInNode(wFindRet& ret, void* left, ssize_t height, const FieldId& key,
                      InternalKeyEntry& rightEntry, bool allowCreate);
     void wRecursiveFind(wFindRet& ret, InternalNode* left, ssize_t height, const FieldId& key,

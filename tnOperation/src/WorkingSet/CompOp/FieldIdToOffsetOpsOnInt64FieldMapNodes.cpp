@@ -65,9 +65,7 @@ InternalNode::~FieldIdToOffsetOpsOnInt64FieldMapInternalNode() {
 
 std::pair<void*, ssize_t> InternalNode::FindChildGivenKey2(const FieldId& key) const {
     ssize_t nk = m_numKeyEntrys;
-    // clang-format off
     TARN_ASSERT(1 <= nk && nk <= 100);
-    // clang-format on
     if (CompareKeys(key, GetEntry(0).m_key) < 0) {
         return {m_ptr.Get(), -1};
     }
@@ -75,9 +73,7 @@ std::pair<void*, ssize_t> InternalNode::FindChildGivenKey2(const FieldId& key) c
     ssize_t hi = nk;
     while (lo < hi) {
         ssize_t mid = (lo + hi) / 2;
-        // clang-format off
         TARN_ASSERT(1 <= mid && mid < nk);
-        // clang-format on
         if (CompareKeys(key, GetEntry(mid).m_key) < 0) {
             hi = mid;
         } else {
@@ -85,38 +81,8 @@ std::pair<void*, ssize_t> InternalNode::FindChildGivenKey2(const FieldId& key) c
         }
     }
     TARN_ASSERT(lo == hi);
-    // clang-format off
     TARN_ASSERT(1 <= lo && lo <= nk);
-    // clang-format on
     return {GetEntry(lo - 1).m_ptr.Get(), lo - 1};
-}
-
-ssize_t InternalNode::FindChildIndexGivenKey(const FieldId& key) const {
-    ssize_t nk = m_numKeyEntrys;
-    // clang-format off
-    TARN_ASSERT(1 <= nk && nk <= 100);
-    // clang-format on
-    if (CompareKeys(key, GetEntry(0).m_key) < 0) {
-        return -1;
-    }
-    ssize_t lo = 1;
-    ssize_t hi = nk;
-    while (lo < hi) {
-        ssize_t mid = (lo + hi) / 2;
-        // clang-format off
-        TARN_ASSERT(1 <= mid && mid < nk);
-        // clang-format on
-        if (CompareKeys(key, GetEntry(mid).m_key) < 0) {
-            hi = mid;
-        } else {
-            lo = mid + 1;
-        }
-    }
-    TARN_ASSERT(lo == hi);
-    // clang-format off
-    TARN_ASSERT(1 <= lo && lo <= nk);
-    // clang-format on
-    return lo - 1;
 }
 
 // ---- Leaf node ---------------------------------------------------------------

@@ -31,6 +31,7 @@
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
 #include "tnPersistStore/IPersistable.h"
 #include "tnPersistStore/pref.h"
+#include "tnUtils/MemSwap.h"
 #include "tnUtils/Types.h"
 
 namespace tarn {
@@ -69,22 +70,6 @@ constexpr schema_t FieldIdToOffsetOpsOnInt64FieldMap_SCHEMA = 1;
 constexpr schema_t FieldIdToOffsetOpsOnInt64FieldMapInternalNode_SCHEMA = 1;
 constexpr schema_t FieldIdToOffsetOpsOnInt64FieldMapLeafNode_SCHEMA = 1;
 
-// Exchanges `n` bytes between two non-overlapping places.
-inline void FieldIdToOffsetOpsOnInt64FieldMapSwapBytes(void* a, void* b, std::size_t n) {
-    auto* pa = static_cast<unsigned char*>(a);
-    auto* pb = static_cast<unsigned char*>(b);
-    unsigned char tmp[64];
-    while (n > 0) {
-        std::size_t k = n < sizeof(tmp) ? n : sizeof(tmp);
-        std::memcpy(tmp, pa, k);
-        std::memcpy(pa, pb, k);
-        std::memcpy(pb, tmp, k);
-        pa += k;
-        pb += k;
-        n -= k;
-    }
-}
-
 // A leaf entry: the key and its per-site table. The map's value_type is the
 // same pair with a constant key; iterators hand out leaf entries under it.
 using FieldIdToOffsetOpsOnInt64FieldMapLeafKeyEntry = std::pair<FieldId, OffsetOpsOnField<int64>>;
@@ -113,9 +98,10 @@ struct FieldIdToOffsetOpsOnInt64FieldMapInternalKeyEntry {
     // Members go in reverse order: m_ptr, then m_key.
     ~FieldIdToOffsetOpsOnInt64FieldMapInternalKeyEntry() = default;
 
-    // Exchanges the two entries' contents as raw bytes.
+    // Exchanges the two entries' contents as raw bytes: each key and
+    // reference changes its place, not its owner count.
     void swap(FieldIdToOffsetOpsOnInt64FieldMapInternalKeyEntry& other) {
-        FieldIdToOffsetOpsOnInt64FieldMapSwapBytes(this, &other, sizeof(*this));
+        memswap(this, &other, sizeof(*this));
     }
 };
 
@@ -146,8 +132,10 @@ public:
     // and its index: -1 for m_ptr, else the slot whose m_ptr it is.
     std::pair<void*, ssize_t> FindChildGivenKey2(const FieldId& key) const;
     void* FindChildGivenKey(const FieldId& key) const { return FindChildGivenKey2(key).first; }
-    // The index of FindChildGivenKey2 without fetching the child.
-    ssize_t FindChildIndexGivenKey(const FieldId& key) const;
+    // The index of FindChildGivenKey2; the child is fetched all the same.
+    ssize_t FindChildIndexGivenKey(const FieldId& key) const {
+        return FindChildGivenKey2(key).second;
+    }
 
     // Persistence (image layout in FieldIdToOffsetOpsOnInt64FieldMapPersist.cpp).
     void Serialise(Archive& ar) const;

@@ -32,6 +32,7 @@
 #include <type_traits>
 #include <utility>
 
+#include "tnOperation/src/Util/VectorTime.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/ArchiveCollection.h"
 #include "tnUtils/Assert.h"
@@ -62,10 +63,9 @@ public:
     using MAP = RelocatableMap<std::map<Guid, SiteOffset<T>>>;
 
     OffsetOpsOnField() = default;
-    // A copy of the records that shares nothing with the source. The B+tree
-    // itself never copy-constructs a payload (it constructs one empty and
-    // assigns it); this exists for callers that hold tables by value.
-    OffsetOpsOnField(const OffsetOpsOnField& rhs) = default;
+    // No copy constructor: a table is made empty and then assigned, as the
+    // B+tree does with its payloads.
+    OffsetOpsOnField(const OffsetOpsOnField& rhs) = delete;
     ~OffsetOpsOnField() = default;
 
     // Builds the copy before releasing the old records; self-assignment safe.
@@ -75,6 +75,13 @@ public:
     }
 
     bool operator==(const OffsetOpsOnField& rhs) const { return m_map == rhs.m_map; }
+
+    // Reconciliation against the store's vector time. Declared only: nothing
+    // in this code base defines or calls them; they belong to the store's
+    // reconciliation of sites, which is not part of this library.
+    void GetRFactor(const VectorTime&, OffsetOpsOnField<T>&) const;
+    bool Merge(const OffsetOpsOnField<T>&, T&);
+    bool InExtent(const VectorTime&) const;
 
     // Records `offset` from site `s` with time stamp `t`. A site's time
     // stamps must not decrease; equal ones are accepted and their offsets

@@ -1,0 +1,15 @@
+// The runtime's raw byte exchange, declared in tnUtils/MemSwap.h.
+
+#include "tnUtils/MemSwap.h"
+
+#include <algorithm>
+
+namespace tarn {
+
+void memswap(void* a, void* b, std::size_t n) {
+    auto* pa = static_cast<unsigned char*>(a);
+    auto* pb = static_cast<unsigned char*>(b);
+    std::swap_ranges(pa, pa + n, pb);
+}
+
+}  // namespace tarn
