@@ -47,10 +47,8 @@ public:
     // returns it; the caller writes at most that many bytes and then calls
     // EndWrite with the position just past the last one.
     octet_t* BeginWrite(ssize_t reserveSize) {
-        // clang-format off
         TARN_ASSERT(m_writeBuffer <= m_pos && m_pos <= m_writeBuffer+ARCHIVE_BUFSIZE);
         TARN_ASSERT(reserveSize <= ARCHIVE_BUFSIZE);
-        // clang-format on
         if (m_pos - m_writeBuffer > ARCHIVE_BUFSIZE - reserveSize) {
             FlushBuffer();
         }
@@ -58,17 +56,13 @@ public:
     }
 
     void EndWrite(octet_t* pos) {
-        // clang-format off
         TARN_ASSERT(m_writeBuffer <= m_pos && m_pos <= pos && pos <= m_writeBuffer+ARCHIVE_BUFSIZE);
-        // clang-format on
         m_pos = pos;
     }
 
     template <typename T>
     void SerialisePod(const T& t) {
-        // clang-format off
         TARN_ASSERT(m_writeBuffer <= m_pos && m_pos <= m_writeBuffer+ARCHIVE_BUFSIZE);
-        // clang-format on
         if (m_pos > m_writeBuffer + ARCHIVE_BUFSIZE - static_cast<ssize_t>(sizeof(T))) {
             FlushBuffer();
         }

@@ -358,9 +358,7 @@ void FieldIdToOffsetOpsOnInt64FieldMap::BalanceInternalLeftToRight(InternalNode*
     const ssize_t ai = anchor->FindChildIndexGivenKey(right->GetEntry(0).m_key);
     TARN_ASSERT(0 <= ai && ai < anchor->m_numKeyEntrys);
     const FieldId& anchorKey = anchor->GetEntry(ai).m_key;
-    // clang-format off
     TARN_ASSERT(CompareKeys(left->GetEntry(nL-1).m_key, anchorKey) < 0);
-    // clang-format on
     TARN_ASSERT(CompareKeys(anchorKey, right->GetEntry(0).m_key) < 0);
 
     TARN_ASSERT(50 < nL && nL <= 100);
@@ -406,9 +404,7 @@ void FieldIdToOffsetOpsOnInt64FieldMap::BalanceInternalRightToLeft(InternalNode*
     TARN_ASSERT(0 <= ai && ai < anchor->m_numKeyEntrys);
     const FieldId& anchorKey = anchor->GetEntry(ai).m_key;
     if (nL >= 1) {
-        // clang-format off
         TARN_ASSERT(CompareKeys(left->GetEntry(nL-1).m_key, anchorKey) < 0);
-        // clang-format on
     }
     TARN_ASSERT(CompareKeys(anchorKey, right->GetEntry(0).m_key) < 0);
 
@@ -455,9 +451,7 @@ void FieldIdToOffsetOpsOnInt64FieldMap::MergeInternalRightToLeft(InternalNode* l
     TARN_ASSERT(0 <= ai && ai < anchor->m_numKeyEntrys);
     const FieldId& anchorKey = anchor->GetEntry(ai).m_key;
     if (nL >= 1) {
-        // clang-format off
         TARN_ASSERT(CompareKeys(left->GetEntry(nL-1).m_key, anchorKey) < 0);
-        // clang-format on
     }
     TARN_ASSERT(CompareKeys(anchorKey, right->GetEntry(0).m_key) < 0);
 
@@ -484,22 +478,16 @@ void FieldIdToOffsetOpsOnInt64FieldMap::ReplaceKeyInAnchor(InternalNode* node,
                                                            const FieldId& oldKey,
                                                            const FieldId& newKey) {
     TARN_ASSERT(node);
-    // clang-format off
     TARN_ASSERT(CompareKeys(oldKey,newKey) != 0);
-    // clang-format on
     const ssize_t i = node->FindChildIndexGivenKey(oldKey);
     TARN_ASSERT(0 <= i && i < node->m_numKeyEntrys);
     node->GetEntry(i).m_key = newKey;
     node->MarkAsDirtyWithoutTrace();
     if (i > 0) {
-        // clang-format off
         TARN_ASSERT(CompareKeys(node->GetEntry(i-1).m_key, newKey) < 0);
-        // clang-format on
     }
     if (i + 1 < node->m_numKeyEntrys) {
-        // clang-format off
         TARN_ASSERT(CompareKeys(node->GetEntry(i+1).m_key, newKey) > 0);
-        // clang-format on
     }
 }
 

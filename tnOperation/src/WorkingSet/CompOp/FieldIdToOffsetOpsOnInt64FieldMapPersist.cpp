@@ -86,9 +86,7 @@ void FieldIdToOffsetOpsOnInt64FieldMapInternalNode::Deserialise(InputArchive& ar
     ar >> m_ptr;
     ssize_t n;
     DeserialiseVariableLengthUint<ssize_t>(ar, n);
-    // clang-format off
     TARN_ASSERT(0 <= n && n <= 100);
-    // clang-format on
     ResizeArrayElements(&GetEntry(0), m_numKeyEntrys, n);
     m_numKeyEntrys = n;
     for (ssize_t i = 0; i < n; ++i) {
@@ -129,9 +127,7 @@ void FieldIdToOffsetOpsOnInt64FieldMapLeafNode::Deserialise(InputArchive& ar) {
     ar >> m_prev >> m_next;
     ssize_t n;
     DeserialiseVariableLengthUint<ssize_t>(ar, n);
-    // clang-format off
     TARN_ASSERT(0 <= n && n <= 100);
-    // clang-format on
     ResizeArrayElements(&GetEntry(0), m_numKeyEntrys, n);
     m_numKeyEntrys = n;
     for (ssize_t i = 0; i < n; ++i) {

@@ -32,9 +32,7 @@ const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMap*) {
 }
 
 void _Register_FieldIdToOffsetOpsOnInt64FieldMap() {
-    // clang-format off
     TARN_ASSERT(tarn::RegisterReflectedClass(&_GetReflected( (FieldIdToOffsetOpsOnInt64FieldMap*) 0),tarn::Tarn_tnOperation_GetXTarget()) == tarn::NSE_OK);
-    // clang-format on
 }
 
 // ---- Internal node -------------------------------------------------------------
@@ -52,9 +50,7 @@ const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapInternalNode*)
 }
 
 void _Register_FieldIdToOffsetOpsOnInt64FieldMapInternalNode() {
-    // clang-format off
     TARN_ASSERT(tarn::RegisterReflectedClass(&_GetReflected( (FieldIdToOffsetOpsOnInt64FieldMapInternalNode*) 0),tarn::Tarn_tnOperation_GetXTarget()) == tarn::NSE_OK);
-    // clang-format on
 }
 
 // ---- Leaf ------------------------------------------------------------------------
@@ -72,9 +68,7 @@ const TypeOps* _GetTypeOps(const FieldIdToOffsetOpsOnInt64FieldMapLeafNode*) {
 }
 
 void _Register_FieldIdToOffsetOpsOnInt64FieldMapLeafNode() {
-    // clang-format off
     TARN_ASSERT(tarn::RegisterReflectedClass(&_GetReflected( (FieldIdToOffsetOpsOnInt64FieldMapLeafNode*) 0),tarn::Tarn_tnOperation_GetXTarget()) == tarn::NSE_OK);
-    // clang-format on
 }
 
 }  // namespace tarn
