@@ -12,8 +12,10 @@
 // otherwise.
 //
 // Stores: `record` is the writer and creates the store on first use; `clear`
-// is the writer of an existing store; the read commands (show, dump,
-// validate, stats) open the store as a reader, beside any writer.
+// is the writer of an existing store; the read commands (show, export, diff,
+// dump, validate, stats) open the store as a reader, beside any writer, and
+// `backup` copies its files beside any writer. `diff` keeps diff(1)'s exit
+// statuses instead (0 equal, 1 different, 2 trouble).
 
 #include <cstddef>
 #include <optional>
