@@ -4,10 +4,11 @@
 // The damage campaign copies a store whose journal holds durable points after
 // its last checkpoint and damages every copy: one byte changed or the file cut
 // short, at a random place, in each of the store's files, or a file removed.
-// `offsetops show`, `validate` and a `record` of a few more operations run on
-// every copy under a time limit and must end with the store's tables (or
-// those of an earlier durable point, where the damage cost the journal its
-// tail) or with a clean error: status 1 and one line on standard error. The
+// `offsetops show`, `validate`, a `backup` and a `record` of a few more
+// operations run on every copy under a time limit and must end with the store's
+// tables (or those of an earlier durable point, where the damage cost the
+// journal its tail; for a backup, the tables the backup shows) or with a
+// clean error: status 1 and one line on standard error. The
 // seed is printed; set TARN_DAMAGE_SEED to replay a run.
 //
 // Then: a damaged lock file while another process uses the store, and a disk
@@ -60,6 +61,8 @@ constexpr int kCutCases = 50 / kSlowdown;
 constexpr auto kTimeLimit = std::chrono::seconds(20);
 
 const char* const kFiles[] = {"data.mdb", "lock.mdb", "journal"};
+// The backup runs before the record, which changes the copy.
+const char* const kCampaignCommands[] = {"show", "validate", "backup", "record"};
 
 Guid Site(int64 n) {
     Guid g{};
@@ -301,7 +304,8 @@ TEST(DamageCampaign, DamagedCopiesKeepADurablePointOrEndWithOneErrorLine) {
         const bool last = i + 1 == kOps;
         for (const auto& [command, text] : {std::pair{"show", ShowText(model)},
                                             {"validate", std::to_string(model.size())},
-                                            {"record", ShowText(recorded)}}) {
+                                            {"record", ShowText(recorded)},
+                                            {"backup", ShowText(model)}}) {
             if (last) {
                 expected[command].final = text;
             } else {
@@ -325,14 +329,18 @@ TEST(DamageCampaign, DamagedCopiesKeepADurablePointOrEndWithOneErrorLine) {
     int reported = 0;
     const auto start = std::chrono::steady_clock::now();
     const std::string copy = dir.Sub("copy");
+    const std::string backup = dir.Sub("backup");
     for (const Damage& damage : damages) {
         fs::remove_all(copy);
+        fs::remove_all(backup);
         fs::copy(original, copy);
         damage.ApplyTo(copy);
-        for (const std::string command : {"show", "validate", "record"}) {
+        for (const std::string command : kCampaignCommands) {
             std::vector<std::string> args{command, "--store", copy};
             if (command == "record") {
                 args.insert(args.end(), {"--ops", laterOps});
+            } else if (command == "backup") {
+                args.insert(args.end(), {"--to", backup});
             }
             const ToolRun run = RunLimited(args, dir);
             Verdict verdict = kUnclean;
@@ -347,8 +355,9 @@ TEST(DamageCampaign, DamagedCopiesKeepADurablePointOrEndWithOneErrorLine) {
                 std::string got = run.out;
                 if (command == "validate") {
                     got = run.out.ends_with("\nvalid\n") ? FieldsRow(run.out) : "(invalid)";
-                } else if (command == "record") {
-                    const ToolRun shown = RunLimited({"show", "--store", copy}, dir);
+                } else if (command == "record" || command == "backup") {
+                    const ToolRun shown =
+                        RunLimited({"show", "--store", command == "record" ? copy : backup}, dir);
                     got = shown.status == 0 ? shown.out : "(show failed: " + shown.err + ")";
                 }
                 const Expected& e = expected[command];
@@ -367,8 +376,8 @@ TEST(DamageCampaign, DamagedCopiesKeepADurablePointOrEndWithOneErrorLine) {
     }
     const double seconds =
         std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
-    std::cout << "damage campaign: " << damages.size() << " damaged copies, " << 3 * damages.size()
-              << " runs in " << seconds << " s:";
+    std::cout << "damage campaign: " << damages.size() << " damaged copies, "
+              << std::size(kCampaignCommands) * damages.size() << " runs in " << seconds << " s:";
     for (std::size_t v = 0; v < std::size(kVerdictNames); ++v) {
         std::cout << (v == 0 ? " " : ", ") << counts[v] << " " << kVerdictNames[v];
         std::string key = kVerdictNames[v];

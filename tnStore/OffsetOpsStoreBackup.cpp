@@ -28,6 +28,7 @@
 #include <limits>
 #include <mutex>
 #include <thread>
+#include <vector>
 
 #include "tnRuntime/LmdbStore.h"
 #include "tnStore/OffsetOpsStore.h"
@@ -213,15 +214,30 @@ int64 FileBytes(const fs::path& path) {
     return ec ? 0 : static_cast<int64>(size);
 }
 
-// The journal position the copied data file's checkpoint covers (0 when it
-// has none: a store made before journals). Opening the copy also checks its
-// data file as any opening does, and makes its lock file, whose absence a
-// later opening would report as a repair.
-uint64 CopiedCheckpoint(const fs::path& copy) {
-    LmdbStoreOptions options;
-    options.mode = OpenMode::ReadOnly;
-    std::unique_ptr<LmdbStore> copied = LmdbStore::Open(copy.string(), options);
-    return copied->FindCounter(kJournalPositionCounter).value_or(0);
+// Opens the copied data file as any opening does (which checks its pages
+// and makes its lock file, whose absence a later opening would report as a
+// repair), reads every image in it (each is checked against its checksum:
+// a copy that cannot be read back is no backup), and returns the journal
+// position its checkpoint covers (0 when it has none: a store made before
+// journals). Damage is reported as the source store's.
+uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
+    try {
+        LmdbStoreOptions options;
+        options.mode = OpenMode::ReadOnly;
+        std::unique_ptr<LmdbStore> copied = LmdbStore::Open(copy.string(), options);
+        std::vector<uint64> identities;
+        copied->ForEachIdentity([&](uint64 oid) { identities.push_back(oid); });
+        for (uint64 oid : identities) {
+            (void)copied->Load(oid);
+        }
+        return copied->FindCounter(kJournalPositionCounter).value_or(0);
+    } catch (const RuntimeError& e) {
+        std::string what = e.what();
+        for (std::size_t at; (at = what.find(copy.string())) != std::string::npos;) {
+            what.replace(at, copy.string().size(), dir);
+        }
+        throw RuntimeError("no backup made: " + what);
+    }
 }
 
 // Copies the data file and the journal of the store in `dir` (whose data
@@ -245,7 +261,7 @@ bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
         FileGrowthReporter reporter(options.progress, data.string(), lmdb.DataBytes());
         lmdb.CopyTo(copy.string(), options.compact);
     }
-    const uint64 checkpoint = CopiedCheckpoint(copy);
+    const uint64 checkpoint = CheckCopy(dir, copy);
     result.checkpointedOperations = checkpoint;
     result.durableOperations = checkpoint;
     result.dataBytes = FileBytes(data);
@@ -286,10 +302,10 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
     BackupResult result;
     for (int attempt = 1; !TryCopy(lmdb, dir, copy.Path(), options, result); ++attempt) {
         if (attempt == kBackupAttempts) {
-            throw RuntimeError("store '" + dir +
-                               "' started a new journal twice at the start of "
-                               "each of " +
-                               std::to_string(kBackupAttempts) + " attempts to copy it; try again");
+            throw RuntimeError("no backup made: in " + std::to_string(kBackupAttempts) +
+                               " attempts, the checkpoint copied from store '" + dir +
+                               "' never met its journal: the store is damaged, or its writer "
+                               "checkpointed twice as each attempt began");
         }
     }
     copy.MoveTo(target);
