@@ -491,7 +491,7 @@ private:
 // again, goes on from it. Twice: with the default journal limit the journal
 // fills the disk, with a limit of 0 (a checkpoint at every durable point)
 // LMDB's commits do too.
-TEST(FullDisk, RecordingStopsWithNoSpaceLeftAndGoesOnOnceThereIsRoom) {
+TEST(FullDisk, RecordingAndBackupsStopWithNoSpaceLeftAndGoOnOnceThereIsRoom) {
     constexpr int64 kFillOps = 60000 / kSlowdown;
     constexpr int64 kFillFields = 20000 / kSlowdown;
     constexpr int64 kEvery = 1000 / kSlowdown;
@@ -536,6 +536,26 @@ TEST(FullDisk, RecordingStopsWithNoSpaceLeftAndGoesOnOnceThereIsRoom) {
         EXPECT_EQ(Shown(store), texts.at(kFillOps));
         RunOk({"validate", "--store", store});
     }
+
+    // A backup onto the small disk that runs out of room leaves nothing
+    // behind, and is made once there is room.
+    const std::string source = dir.Sub("source");
+    fs::copy(store, source);
+    fs::remove_all(store);
+    const std::string copy = dir.Sub("disk/copy");
+    disk.FillLeaving(64 << 10);
+    const ToolRun full = RunLimited({"backup", "--store", source, "--to", copy}, dir);
+    EXPECT_EQ(full.status, 1) << full.out;
+    EXPECT_TRUE(IsOneErrorLine(full.err)) << full.err;
+    EXPECT_THAT(full.err, ::testing::HasSubstr("no space left on device"));
+    std::set<std::string> left;
+    for (const fs::directory_entry& entry : fs::directory_iterator(dir.Sub("disk"))) {
+        left.insert(entry.path().string());
+    }
+    EXPECT_EQ(left, std::set<std::string>{disk.Filler()});
+    fs::remove(disk.Filler());
+    RunOk({"backup", "--store", source, "--to", copy});
+    EXPECT_EQ(Shown(copy), texts.at(kFillOps));
 }
 
 }  // namespace

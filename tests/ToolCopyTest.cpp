@@ -187,6 +187,8 @@ TEST(ToolCopies, BackupBesideARunningRecordHoldsADurablePoint) {
     const ToolRun refused = Tool({"backup", "--store", store, "--to", dir.Sub("after")});
     EXPECT_EQ(refused.status, 1);
     EXPECT_THAT(refused.err, OneLineWith("exists and is not empty"));
+    EXPECT_THAT(Tool({"backup", "--store", store, "--to", store + "/copy"}).err,
+                OneLineWith("is inside the store"));
     EXPECT_EQ(Tool({"backup", "--store", dir.Sub("missing"), "--to", dir.Sub("x")}).status, 1);
     EXPECT_FALSE(std::filesystem::exists(dir.Sub("x")));
 }

@@ -298,6 +298,12 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
         throw RuntimeError("backup target '" + to + "' exists and is not empty");
     }
     RequireFreeTarget(target);
+    std::error_code ec;
+    const fs::path store = fs::weakly_canonical(dir, ec);
+    const fs::path inside = fs::weakly_canonical(target, ec).lexically_relative(store);
+    if (!ec && !inside.empty() && *inside.begin() != "..") {
+        throw RuntimeError("backup target '" + to + "' is inside the store '" + dir + "'");
+    }
     PartialCopy copy(target);
     BackupResult result;
     for (int attempt = 1; !TryCopy(lmdb, dir, copy.Path(), options, result); ++attempt) {
