@@ -294,6 +294,43 @@ TEST_F(StoreDir, ACacheBoundKeepsTheSameTablesWithinTheBound) {
                  RuntimeError);
 }
 
+// A reader with a cache bound keeps to it also while it replays a long
+// journal: what replaying changed goes to its overlay, not to the store.
+TEST_F(StoreDir, ABoundedReaderReplaysALongJournalWithinTheBound) {
+    Tables expected;
+    InCrashingChild([&](OffsetOpsStore& store) {
+        for (int64 i = 0; i < 20000; ++i) {
+            store.Record(Opid(Site(1 + i % 3), i), Field(1 + static_cast<uint64>(i * 7919 % 5000)),
+                         i);
+            if (i % 100 == 99) {
+                store.Sync();
+            }
+            if (i == 99) {
+                store.Checkpoint();
+            }
+        }
+    });
+    for (int64 i = 0; i < 20000; ++i) {
+        auto& so = expected[Field(1 + static_cast<uint64>(i * 7919 % 5000))][Site(1 + i % 3)];
+        so = {i, so.second + i};
+    }
+    const auto imagesBefore = fs::file_size(m_dir + "/data.mdb");
+    StoreOptions reading = Reading();
+    reading.cacheObjects = 40;
+    {
+        OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, reading);
+        EXPECT_EQ(AllTables(reader), expected);
+        const StoreStatistics stats = reader.Stats();
+        EXPECT_EQ(stats.replayedOperations, 19900);
+        EXPECT_GT(stats.Nodes(), reading.cacheObjects);
+        EXPECT_LE(stats.peakResidents, reading.cacheObjects);
+        EXPECT_EQ(reader.Find(Field(1))->m_map.getmap().size(), 3u);
+    }
+    EXPECT_EQ(fs::file_size(m_dir + "/data.mdb"), imagesBefore);
+    OffsetOpsStore writer = OffsetOpsStore::Open(m_dir);
+    EXPECT_EQ(AllTables(writer), expected);
+}
+
 // A backup holds the last durable point, whatever the writer recorded since,
 // and opens as a store of its own.
 TEST_F(StoreDir, BackupsHoldTheLastDurablePointAndOpenAsStores) {

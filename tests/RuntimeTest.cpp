@@ -13,6 +13,7 @@
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/MemoryStore.h"
+#include "tnRuntime/OverlayStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnUtils/MemoryOutputStream.h"
@@ -342,6 +343,48 @@ TEST_F(RuntimeTest, LoaderChecksClassAndLengthOfEveryImage) {
     any.m_oid = OID(Seid(2));
     EXPECT_NE(any.Get(), nullptr);
     EXPECT_THROW(cref<TestNode>(OID(Seid(2))).Get(), RuntimeError);
+}
+
+// An overlay takes a space's commits and answers before its base, which
+// never changes: a space over it commits, releases and loads again.
+TEST_F(RuntimeTest, OverlayKeepsCommitsToItselfAndReadsThroughToItsBase) {
+    {
+        Open();
+        m_space->SetRoot("tree", BuildTree(4)->GetPersistObjState().m_oid);
+        m_space->SetCounter("position", 7);
+        m_space->Commit();
+    }
+    const ssize_t baseImages = m_store->Stats().numImages;
+    auto overlay = std::make_shared<OverlayStore>(m_store);
+    m_guard.reset();
+    CSpace space(overlay);
+    CSpaceGuard guard(space, LockMode::Exclusive);
+    auto* root = static_cast<TestNode*>(space.Resolve(space.GetRoot("tree"), nullptr).m_self);
+    EXPECT_EQ(Walk(root), std::make_pair(int64{120}, 15));
+    root->m_value = 1000;
+    root->MarkAsDirtyWithoutTrace();
+    TestNode* added = DollarNew(new TestNode(5));
+    TestNode* leaf = root->m_left->m_left->m_left.Get();
+    leaf->m_left = added;
+    leaf->MarkAsDirtyWithoutTrace();
+    AsyncPermanentlyDeleteObject(ptr<IPersistable>(root->m_right->m_right->m_right.Get()));
+    root->m_right->m_right->m_right = nullptr;
+    root->m_right->m_right->MarkAsDirtyWithoutTrace();
+    space.SetCounter("position", 9);
+    space.Commit();
+    space.DropCleanResidents();
+    EXPECT_EQ(space.NumResidents(), 0);
+
+    root = static_cast<TestNode*>(space.Resolve(space.GetRoot("tree"), nullptr).m_self);
+    EXPECT_EQ(Walk(root), std::make_pair(int64{120 - 1 + 1000 - 15 + 5}, 15));
+    EXPECT_EQ(space.GetCounter("position"), 9u);
+    EXPECT_GT(overlay->FileBytes(), 0u);
+    EXPECT_EQ(m_store->Stats().numImages, baseImages);
+    EXPECT_EQ(m_store->FindCounter("position"), 7u);
+    EXPECT_EQ(overlay->NextIdentity(), m_store->NextIdentity() + 1);
+    std::vector<uint64> identities;
+    overlay->ForEachIdentity([&](uint64 oid) { identities.push_back(oid); });
+    EXPECT_EQ(identities.size(), 15u);
 }
 
 TEST_F(RuntimeTest, MisuseStopsTheProcess) {

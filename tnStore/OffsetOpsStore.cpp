@@ -9,6 +9,7 @@
 
 #include "tnRuntime/LmdbStore.h"
 #include "tnRuntime/MemoryStore.h"
+#include "tnRuntime/OverlayStore.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnStore/StoreImpl.h"
 #include "tnStore/TreeWalk.h"
@@ -164,8 +165,16 @@ std::unique_ptr<LmdbStore> OpenLmdb(OffsetOpsStore::Impl& s) {
 void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
     s.record.reset();
     s.space.reset();
+    s.overlay.reset();
     s.store = std::make_shared<CountingStore>(std::move(store));
-    s.space = std::make_unique<CSpace>(s.store);
+    std::shared_ptr<IStore> spaceStore = s.store;
+    if (s.reader && s.options.cacheObjects > 0) {
+        // A bounded reader commits what replaying the journal changed to an
+        // overlay of its own, so that it can release those objects too.
+        s.overlay = std::make_shared<OverlayStore>(s.store);
+        spaceStore = s.overlay;
+    }
+    s.space = std::make_unique<CSpace>(spaceStore);
     s.checkpointed = s.space->GetCounter(kJournalPositionCounter).value_or(0);
 }
 
@@ -280,6 +289,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
         // previous attempt's snapshot before taking the next.
         s.record.reset();
         s.space.reset();
+        s.overlay.reset();
         s.lmdb = nullptr;
         s.store.reset();
         OpenSpace(s, OpenLmdb(s));
@@ -306,6 +316,7 @@ void OpenReader(OffsetOpsStore::Impl& s) {
                         throw SnapshotTooOld{};
                     }
                     first = false;
+                    s.MakeRoom();
                     ReplayEntry(s, seq, e);
                 });
             if (scan.base > s.checkpointed) {
@@ -368,8 +379,10 @@ void OffsetOpsStore::Impl::RequireSoundTree() const {
 }
 
 // Before each operation: room for the most one operation can add. Clean
-// objects are released; the changed objects of operations that are not yet
-// durable stay until the next durable point checkpoints them.
+// objects are released. A writer's changed objects of operations that are
+// not yet durable stay until the next durable point checkpoints them; a
+// bounded reader commits its changed objects to its overlay first, so that
+// they can be released as well.
 void OffsetOpsStore::Impl::MakeRoom() {
     const ssize_t bound = options.cacheObjects;
     if (bound <= 0) {
@@ -385,6 +398,9 @@ void OffsetOpsStore::Impl::MakeRoom() {
     }
     if (space->NumResidents() > limit) {
         NotePeak();
+        if (overlay != nullptr) {
+            space->Commit();
+        }
         space->EvictCleanResidents(limit / 2);
     }
 }
@@ -423,6 +439,7 @@ void OffsetOpsStore::Impl::NotePeak() {
 void OffsetOpsStore::Impl::Release() {
     record.reset();
     space.reset();
+    overlay.reset();
     journal.reset();
     lmdb = nullptr;
     store.reset();

@@ -91,6 +91,9 @@ struct StoreOptions {
     std::size_t journalLimitBytes = std::size_t{64} << 20;
     // At most this many tree objects in memory at durable points (0: no
     // bound). Must leave room for one operation: see MinCacheObjects().
+    // A reader keeps to it throughout, also while it replays the journal: it
+    // writes the objects that replaying changed to a temporary file of its
+    // own (unlinked, in TMPDIR) and loads them again from there.
     ssize_t cacheObjects = 0;
 };
 

@@ -20,6 +20,7 @@
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/LmdbStore.h"
+#include "tnRuntime/OverlayStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnStore/CountingStore.h"
 #include "tnStore/Journal.h"
@@ -76,6 +77,9 @@ struct OffsetOpsStore::Impl {
 
     std::shared_ptr<CountingStore> store;
     LmdbStore* lmdb = nullptr;  // under `store`, for on-disk stores
+    // Bounded readers: between the space and `store`, taking the space's
+    // commits (see MakeRoom).
+    std::shared_ptr<OverlayStore> overlay;
     std::unique_ptr<CSpace> space;
     std::unique_ptr<SpaceRef<OffsetOps>> record;
     std::unique_ptr<Journal> journal;  // writers of on-disk stores
