@@ -155,13 +155,7 @@ TEST(ToolCopies, BackupBesideARunningRecordHoldsADurablePoint) {
     RunOk({"record", "--store", store, "--generate", "1000", "--fields", "300", "--sites", "3",
            "--seed", "1"});
     std::set<std::string> durablePoints{ShowText(model)};
-    std::string ops;
-    for (uint64 seed = 2; seed < 40; ++seed) {
-        const std::string hundred = Generated({100, 300, 3, seed}, model);
-        model = ModelOf(hundred, model);
-        durablePoints.insert(ShowText(model));
-        ops += hundred;
-    }
+    const std::string ops = HundredsAfter(model, 300, 3, 2, 40, durablePoints);
     const ToolRun run = ToolBeside(
         {"record", "--store", store, "--ops", "-", "--commit-every", "100", "--journal-limit", "0"},
         ops, [&] {

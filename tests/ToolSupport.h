@@ -14,6 +14,7 @@
 #include <fstream>
 #include <functional>
 #include <map>
+#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -186,6 +187,22 @@ inline std::string Generated(const tool::GeneratorSettings& settings, const Mode
     }
     EXPECT_EQ(error, "");
     return text;
+}
+
+// Generated operations in runs of a hundred, seeds `firstSeed` up to
+// `endSeed`, over `fields` fields from `sites` sites, continuing `model`:
+// their ops text. `model` becomes the tables after them all, and
+// `durablePoints` receives the show text after each hundred.
+inline std::string HundredsAfter(Model& model, int64 fields, int64 sites, uint64 firstSeed,
+                                 uint64 endSeed, std::set<std::string>& durablePoints) {
+    std::string ops;
+    for (uint64 seed = firstSeed; seed < endSeed; ++seed) {
+        const std::string hundred = Generated({100, fields, sites, seed}, model);
+        model = ModelOf(hundred, model);
+        durablePoints.insert(ShowText(model));
+        ops += hundred;
+    }
+    return ops;
 }
 
 }  // namespace tarn::testing

@@ -117,13 +117,7 @@ TEST(ToolRoundTrip, RecordShowValidateStatsDumpAndClearInSeparateProcesses) {
     RunOk({"record", "--store", store, "--generate", "500", "--fields", "400", "--sites", "3",
            "--seed", "12"});
     std::set<std::string> durablePoints{ShowText(model)};  // what show may print meanwhile
-    std::string ops;
-    for (uint64 seed = 13; seed < 28; ++seed) {
-        const std::string hundred = Generated({100, 400, 3, seed}, model);
-        model = ModelOf(hundred, model);
-        durablePoints.insert(ShowText(model));
-        ops += hundred;
-    }
+    const std::string ops = HundredsAfter(model, 400, 3, 13, 28, durablePoints);
     const ToolRun run = ToolBeside(
         {"record", "--store", store, "--ops", "-", "--commit-every", "100", "--journal-limit", "0"},
         ops, [&] {

@@ -216,8 +216,9 @@ int64 FileBytes(const fs::path& path) {
 
 // Opens the copied data file as any opening does (which checks its pages
 // and makes its lock file, whose absence a later opening would report as a
-// repair), reads every image in it (each is checked against its checksum:
-// a copy that cannot be read back is no backup), and returns the journal
+// repair), looks up every image in it and each root's (each image is
+// checked against its checksum: a copy that cannot be read back is no
+// backup), and returns the journal
 // position its checkpoint covers (0 when it has none: a store made before
 // journals). Damage is reported as the source store's.
 uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
@@ -227,8 +228,20 @@ uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
         std::unique_ptr<LmdbStore> copied = LmdbStore::Open(copy.string(), options);
         std::vector<uint64> identities;
         copied->ForEachIdentity([&](uint64 oid) { identities.push_back(oid); });
+        // A key the walk finds and the lookup misses means damaged index
+        // pages: a reader of the copy would find that image missing.
         for (uint64 oid : identities) {
-            (void)copied->Load(oid);
+            if (!copied->Load(oid)) {
+                throw RuntimeError("LMDB store '" + copy.string() + "': image #" +
+                                   std::to_string(oid) +
+                                   " is listed but cannot be looked up: its index is damaged");
+            }
+        }
+        for (const auto& [name, oid] : copied->Roots()) {
+            if (!copied->Load(oid)) {
+                throw RuntimeError("LMDB store '" + copy.string() + "': root '" + name +
+                                   "' names #" + std::to_string(oid) + ", which has no image");
+            }
         }
         return copied->FindCounter(kJournalPositionCounter).value_or(0);
     } catch (const RuntimeError& e) {
