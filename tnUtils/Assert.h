@@ -15,9 +15,10 @@
 //   tarn::cref<void>& tarn::cref<void>::operator=(void*)
 // Clang prints
 //   tarn::cref<void> &tarn::cref<void>::operator=(void *)
-// and the texts the system documents use the same spacing with an unqualified
-// return type:
+// and others print Clang's spacing with the return type unqualified:
 //   cref<void> &tarn::cref<void>::operator=(void *)
+// Tools that match assertion lines should match the expression text and the
+// function's qualified name, not the whole signature.
 // In a member of a class template GCC names the template and appends the
 // arguments, e.g. "T* tarn::cref<T>::GetNotNull() const [with T = tarn::X]".
 //
