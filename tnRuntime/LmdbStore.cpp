@@ -566,28 +566,45 @@ std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
     return value;
 }
 
+// A read transaction on the latest commit. A writable store renews its
+// reader; a ReadOnly store opens a second transaction beside its snapshot
+// (the environment is opened with MDB_NOTLS, so one thread may hold both).
+// The store's mutex must be held.
+class LmdbStore::LatestRead {
+public:
+    explicit LatestRead(LmdbStore& store) : m_own(store.m_readOnly) {
+        if (!m_own) {
+            m_txn = store.BeginRead();
+            return;
+        }
+        const int rc = mdb_txn_begin(store.m_env, nullptr, MDB_RDONLY, &m_txn);
+        if (rc == MDB_MAP_RESIZED) {
+            store.Fail("the writer has grown the store since it was opened here; open it again");
+        }
+        store.Check(rc, "beginning a read transaction");
+    }
+    ~LatestRead() {
+        if (m_own) {
+            mdb_txn_abort(m_txn);
+        } else {
+            mdb_txn_reset(m_txn);
+        }
+    }
+    LatestRead(const LatestRead&) = delete;
+    LatestRead& operator=(const LatestRead&) = delete;
+
+    MDB_txn* Txn() const { return m_txn; }
+
+private:
+    bool m_own;
+    MDB_txn* m_txn = nullptr;
+};
+
 std::optional<uint64> LmdbStore::FindLatestCounter(std::string_view name) {
-    if (!m_readOnly) {
-        return FindCounter(name);
-    }
     std::lock_guard lock(m_mutex);
-    // A second read transaction beside the snapshot (the environment is
-    // opened with MDB_NOTLS, so one thread may hold both).
-    MDB_txn* txn = nullptr;
-    const int rc = mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &txn);
-    if (rc == MDB_MAP_RESIZED) {
-        Fail("the writer has grown the store since it was opened here; open it again");
-    }
-    Check(rc, "beginning a read transaction");
+    LatestRead read(*this);
     bool found = false;
-    uint64 value = 0;
-    try {
-        value = ReadMeta64(txn, MetaKey(kCounterPrefix, name), &found);
-    } catch (...) {
-        mdb_txn_abort(txn);
-        throw;
-    }
-    mdb_txn_abort(txn);
+    const uint64 value = ReadMeta64(read.Txn(), MetaKey(kCounterPrefix, name), &found);
     if (!found) {
         return std::nullopt;
     }
@@ -756,13 +773,36 @@ StoreStats LmdbStore::Stats() {
     return stats;
 }
 
-uint64 LmdbStore::DataBytes() {
+uint64 LmdbStore::DataBytes(bool withoutFreePages) {
     std::lock_guard lock(m_mutex);
     MDB_envinfo info;
     Check(mdb_env_info(m_env, &info), "reading the environment's size");
     MDB_stat stat;
     Check(mdb_env_stat(m_env, &stat), "reading the environment's page size");
-    return (static_cast<uint64>(info.me_last_pgno) + 1) * stat.ms_psize;
+    uint64 pages = static_cast<uint64>(info.me_last_pgno) + 1;
+    if (withoutFreePages) {
+        // LMDB's free list is its database 0: a record per transaction whose
+        // value is an array of page numbers, the first element their count.
+        LatestRead read(*this);
+        int rc = 0;
+        Cursor cursor(read.Txn(), 0, &rc);
+        Check(rc, "reading the free list");
+        MDB_val key;
+        MDB_val value;
+        uint64 free = 0;
+        while ((rc = cursor.Get(&key, &value, MDB_NEXT)) == MDB_SUCCESS) {
+            if (value.mv_size >= sizeof(std::size_t)) {
+                std::size_t count;
+                std::memcpy(&count, value.mv_data, sizeof count);
+                free += count;
+            }
+        }
+        if (rc != MDB_NOTFOUND) {
+            Check(rc, "reading the free list");
+        }
+        pages -= std::min(free, pages);
+    }
+    return pages * stat.ms_psize;
 }
 
 std::size_t LmdbStore::MapSize() {

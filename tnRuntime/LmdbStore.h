@@ -117,8 +117,9 @@ public:
     // copy is as small as its contents. Runs beside the writer; a copy holds
     // one commit, whatever the writer commits meanwhile.
     void CopyTo(const std::string& dir, bool compact);
-    // The bytes of the data file that the latest commit uses.
-    uint64 DataBytes();
+    // The bytes of the data file that the latest commit uses, or (when
+    // `withoutFreePages`) about what a compacting copy of it takes.
+    uint64 DataBytes(bool withoutFreePages = false);
 
     const std::string& Directory() const { return m_dir; }
     // What opening repaired (a lock file made anew), one line each.
@@ -128,6 +129,7 @@ public:
 
 private:
     class ReadScope;
+    class LatestRead;
 
     LmdbStore(std::string dir, const LmdbStoreOptions& options);
 

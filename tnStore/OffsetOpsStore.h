@@ -164,7 +164,7 @@ struct BackupOptions {
     bool compact = false;
     // Called a few times a second while the data file is copied, from
     // another thread, with the bytes copied so far and about how many there
-    // are (a compacting copy ends below that).
+    // are in all.
     using ProgressFn = std::function<void(uint64 copied, uint64 total)>;
     ProgressFn progress;
 };

@@ -271,7 +271,8 @@ bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
         fs::remove(stale, ec);
     }
     {
-        FileGrowthReporter reporter(options.progress, data.string(), lmdb.DataBytes());
+        FileGrowthReporter reporter(options.progress, data.string(),
+                                    lmdb.DataBytes(options.compact));
         lmdb.CopyTo(copy.string(), options.compact);
     }
     const uint64 checkpoint = CheckCopy(dir, copy);
