@@ -89,8 +89,9 @@ int RunExport(const std::string& store, const std::string& outFile, const WalkSe
 //   < FIELD --> TABLE            only in a
 //   > FIELD --> TABLE            only in b
 //   ! FIELD --> TABLE_A TABLE_B  in both, with other tables
-// then a count. Status 0 when the maps are equal, 1 when they differ, 2 on
-// any error (diff(1)'s convention).
+// and nothing else (on a terminal, a count follows on `err`). Status 0 when
+// the maps are equal, 1 when they differ, 2 on any error (diff(1)'s
+// convention).
 int RunDiff(const std::string& a, const std::string& b, const WalkSettings& settings,
             std::ostream& out, std::ostream& err);
 

@@ -1,7 +1,7 @@
 // offsetops diff: the fields whose tables two stores do not agree on.
 
-#include <filesystem>
 #include <deque>
+#include <filesystem>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/OstreamOutputStream.h"
@@ -131,10 +131,14 @@ int RunDiff(const std::string& a, const std::string& b, const WalkSettings& sett
         if (counts.Total() == 0) {
             return 0;
         }
-        out << "# " << counts.Total()
-            << (counts.Total() == 1 ? " field differs: " : " fields differ: ") << counts.onlyA
-            << " only in '" << a << "', " << counts.onlyB << " only in '" << b << "', "
-            << counts.other << " with other tables\n";
+        // Standard output holds a line per field and nothing else; the count
+        // is for a person at a terminal.
+        if (settings.progress) {
+            err << "offsetops: " << counts.Total()
+                << (counts.Total() == 1 ? " field differs: " : " fields differ: ") << counts.onlyA
+                << " only in '" << a << "', " << counts.onlyB << " only in '" << b << "', "
+                << counts.other << " with other tables\n";
+        }
         return kDiffer;
     } catch (const RuntimeError& e) {
         Fail(err, e.what());
