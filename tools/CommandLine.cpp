@@ -209,10 +209,7 @@ ShowQuery ShowQueryOf(const Command& show) {
         throw UsageError{"--from " + ToString(*query.from) + " comes after --to " +
                          ToString(*query.to)};
     }
-    if (show.Has("--limit")) {
-        if (query.field) {
-            throw UsageError{"--limit goes with a walk over several fields, not --field"};
-        }
+    if (show.Has("--limit")) {  // with --field: one field at most anyway
         query.limit = static_cast<int64>(show.Number("--limit", 0, kMaxLimit, 0));
     }
     return query;
