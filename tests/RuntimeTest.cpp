@@ -387,6 +387,33 @@ TEST_F(RuntimeTest, OverlayKeepsCommitsToItselfAndReadsThroughToItsBase) {
     EXPECT_EQ(identities.size(), 15u);
 }
 
+// Rewritten images leave garbage in the overlay's file, which it drops once
+// the file is twice what its live images take.
+TEST(OverlayStore, RewrittenImagesKeepTheFileWithinTwiceTheLiveBytes) {
+    auto base = std::make_shared<MemoryStore>();
+    OverlayStore overlay(base, 4096);
+    for (int round = 0; round < 100; ++round) {
+        CommitBatch batch;
+        for (uint64 oid = 1; oid <= 10; ++oid) {
+            StoredImage image{"tarn::TestNode",
+                              std::vector<octet_t>(1000 + oid, static_cast<octet_t>(round))};
+            batch.writes.emplace_back(oid, std::move(image));
+        }
+        if (round == 50) {
+            batch.deletes.push_back(3);
+        }
+        batch.nextIdentity = 11;
+        overlay.Commit(batch);
+        EXPECT_LE(overlay.FileBytes(), std::max<uint64>(4096, 2 * 10 * 1010));
+    }
+    for (uint64 oid = 1; oid <= 10; ++oid) {
+        const std::optional<StoredImage> image = overlay.Load(oid);
+        ASSERT_TRUE(image.has_value());
+        EXPECT_EQ(image->bytes, std::vector<octet_t>(1000 + oid, octet_t{99}));
+    }
+    EXPECT_EQ(base->Stats().numImages, 0);
+}
+
 TEST_F(RuntimeTest, MisuseStopsTheProcess) {
     EXPECT_TARN_ASSERT(DollarNew(new TestNode()), "space != nullptr");
     EXPECT_TARN_ASSERT(cref<TestNode>(OID(Seid(1))).Get(), "space != nullptr");

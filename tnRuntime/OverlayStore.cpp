@@ -23,16 +23,48 @@ std::string TempDirectory() {
                                                            : std::strerror(error)));
 }
 
-}  // namespace
-
-OverlayStore::OverlayStore(std::shared_ptr<IStore> base) : m_base(std::move(base)) {
+// An unlinked temporary file, open for reading and writing.
+int MakeTempFile() {
     std::string path = TempDirectory() + "/tarn-overlay-XXXXXX";
-    m_fd = ::mkostemp(path.data(), O_CLOEXEC);
-    if (m_fd < 0) {
+    const int fd = ::mkostemp(path.data(), O_CLOEXEC);
+    if (fd < 0) {
         Failed("making a temporary file in '" + TempDirectory() + "'", errno);
     }
     ::unlink(path.c_str());
+    return fd;
 }
+
+void WriteAll(int fd, const octet_t* bytes, std::size_t size, uint64 offset) {
+    for (std::size_t done = 0; done < size;) {
+        const ssize_t n =
+            ::pwrite(fd, bytes + done, size - done, static_cast<off_t>(offset + done));
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            Failed("writing the overlay's temporary file", errno);
+        }
+        done += static_cast<std::size_t>(n);
+    }
+}
+
+void ReadAll(int fd, octet_t* bytes, std::size_t size, uint64 offset) {
+    for (std::size_t done = 0; done < size;) {
+        const ssize_t n = ::pread(fd, bytes + done, size - done, static_cast<off_t>(offset + done));
+        if (n <= 0) {
+            if (n < 0 && errno == EINTR) {
+                continue;
+            }
+            Failed("reading the overlay's temporary file", n < 0 ? errno : EIO);
+        }
+        done += static_cast<std::size_t>(n);
+    }
+}
+
+}  // namespace
+
+OverlayStore::OverlayStore(std::shared_ptr<IStore> base, uint64 compactionFloor)
+    : m_base(std::move(base)), m_compactionFloor(compactionFloor), m_fd(MakeTempFile()) {}
 
 OverlayStore::~OverlayStore() {
     ::close(m_fd);
@@ -47,17 +79,29 @@ std::size_t OverlayStore::ClassIndex(const std::string& name) {
     return static_cast<std::size_t>(it - m_classNames.begin());
 }
 
-void OverlayStore::WriteAt(uint64 offset, const std::vector<octet_t>& bytes) {
-    for (std::size_t done = 0; done < bytes.size();) {
-        const ssize_t n = ::pwrite(m_fd, bytes.data() + done, bytes.size() - done,
-                                   static_cast<off_t>(offset + done));
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            Failed("writing the overlay's temporary file", errno);
+// Rewrites the file with the live images only, in a new file that replaces
+// it when complete; the old file stays in use if anything fails.
+void OverlayStore::Compact() {
+    const int fd = MakeTempFile();
+    try {
+        uint64 end = 0;
+        std::vector<octet_t> bytes;
+        std::unordered_map<uint64, Extent> moved;
+        moved.reserve(m_images.size());
+        for (const auto& [oid, extent] : m_images) {
+            bytes.resize(extent.size);
+            ReadAll(m_fd, bytes.data(), bytes.size(), extent.offset);
+            WriteAll(fd, bytes.data(), bytes.size(), end);
+            moved.emplace(oid, Extent{end, extent.size, extent.className});
+            end += extent.size;
         }
-        done += static_cast<std::size_t>(n);
+        ::close(m_fd);
+        m_fd = fd;
+        m_end = end;
+        m_images.swap(moved);
+    } catch (...) {
+        ::close(fd);
+        throw;
     }
 }
 
@@ -72,18 +116,7 @@ std::optional<StoredImage> OverlayStore::Load(uint64 oid) {
             StoredImage image;
             image.className = m_classNames[it->second.className];
             image.bytes.resize(it->second.size);
-            for (std::size_t done = 0; done < image.bytes.size();) {
-                const ssize_t n =
-                    ::pread(m_fd, image.bytes.data() + done, image.bytes.size() - done,
-                            static_cast<off_t>(it->second.offset + done));
-                if (n <= 0) {
-                    if (n < 0 && errno == EINTR) {
-                        continue;
-                    }
-                    Failed("reading the overlay's temporary file", n < 0 ? errno : EIO);
-                }
-                done += static_cast<std::size_t>(n);
-            }
+            ReadAll(m_fd, image.bytes.data(), image.bytes.size(), it->second.offset);
             return image;
         }
     }
@@ -139,17 +172,26 @@ void OverlayStore::Commit(const CommitBatch& batch) {
     written.reserve(batch.writes.size());
     uint64 end = m_end;
     for (const auto& [oid, image] : batch.writes) {
-        WriteAt(end, image.bytes);
+        WriteAll(m_fd, image.bytes.data(), image.bytes.size(), end);
         written.emplace_back(oid, Extent{end, image.bytes.size(), ClassIndex(image.className)});
         end += image.bytes.size();
     }
     m_end = end;
     for (const auto& [oid, extent] : written) {
-        m_images[oid] = extent;
+        auto [it, added] = m_images.try_emplace(oid, extent);
+        if (!added) {
+            m_liveBytes -= it->second.size;
+            it->second = extent;
+        }
+        m_liveBytes += extent.size;
         m_deleted.erase(oid);
     }
     for (uint64 oid : batch.deletes) {
-        m_images.erase(oid);
+        auto it = m_images.find(oid);
+        if (it != m_images.end()) {
+            m_liveBytes -= it->second.size;
+            m_images.erase(it);
+        }
         m_deleted.insert(oid);
     }
     for (const auto& [name, oid] : batch.roots) {
@@ -159,6 +201,14 @@ void OverlayStore::Commit(const CommitBatch& batch) {
         m_counters[name] = value;
     }
     m_nextIdentity = batch.nextIdentity;
+    // The batch is in. A compaction that fails (a full disk) leaves the file
+    // as it was, only larger: nothing to report.
+    if (m_end > m_compactionFloor && m_end > 2 * m_liveBytes) {
+        try {
+            Compact();
+        } catch (const RuntimeError&) {
+        }
+    }
 }
 
 void OverlayStore::ForEachIdentity(const std::function<void(uint64)>& fn) {

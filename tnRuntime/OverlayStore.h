@@ -9,7 +9,10 @@
 // Committed images go to an unlinked temporary file (in TMPDIR, or /tmp),
 // so only their index (an identity, an offset and a length each) stays in
 // memory; the file goes away with the store, also when the process dies. A
-// newer image of an identity is appended, the older one left where it was.
+// newer image of an identity is appended, the older one left where it was;
+// once the file is more than twice what its live images take (and more than
+// the compaction floor), it is rewritten with those alone, so that it stays
+// within a few times the size of what the space changed.
 // Deletions, roots, counters and the identity counter are kept in memory and
 // answered before the base's. Stats() is the base's: the overlay holds no
 // stored images of its own.
@@ -31,8 +34,11 @@ namespace tarn {
 
 class OverlayStore final : public IStore {
 public:
+    static constexpr uint64 kDefaultCompactionFloor = uint64{64} << 20;
+
     // Throws RuntimeError when no temporary file can be made.
-    explicit OverlayStore(std::shared_ptr<IStore> base);
+    explicit OverlayStore(std::shared_ptr<IStore> base,
+                          uint64 compactionFloor = kDefaultCompactionFloor);
     ~OverlayStore() override;
     OverlayStore(const OverlayStore&) = delete;
     OverlayStore& operator=(const OverlayStore&) = delete;
@@ -57,12 +63,14 @@ private:
     };
 
     std::size_t ClassIndex(const std::string& name);
-    void WriteAt(uint64 offset, const std::vector<octet_t>& bytes);
+    void Compact();
 
     std::shared_ptr<IStore> m_base;
+    uint64 m_compactionFloor;
     std::mutex m_mutex;
     int m_fd = -1;
     uint64 m_end = 0;
+    uint64 m_liveBytes = 0;  // of the images the index points to
     std::unordered_map<uint64, Extent> m_images;
     std::set<uint64> m_deleted;
     std::map<std::string, uint64, std::less<>> m_roots;
