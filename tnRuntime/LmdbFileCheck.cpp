@@ -15,6 +15,7 @@
 #include <utility>
 #include <vector>
 
+#include "tnUtils/FileIo.h"
 #include "tnUtils/RuntimeError.h"
 #include "tnUtils/Types.h"
 #include "tnUtils/UniqueFd.h"
@@ -123,20 +124,11 @@ public:
     // Reads `size` bytes at `offset`; false when the file ends before (errno
     // 0) or reading fails.
     bool ReadAt(octet_t* out, std::size_t size, uint64 offset) const {
-        errno = 0;
-        std::size_t done = 0;
-        while (done < size) {
-            const ssize_t n =
-                ::pread(m_fd.Get(), out + done, size - done, static_cast<off_t>(offset + done));
-            if (n < 0 && errno == EINTR) {
-                continue;
-            }
-            if (n <= 0) {
-                return false;
-            }
-            done += static_cast<std::size_t>(n);
+        const ssize_t n = tarn::ReadAt(m_fd.Get(), out, size, offset);
+        if (n >= 0) {
+            errno = 0;  // the file ended
         }
-        return true;
+        return n == static_cast<ssize_t>(size);
     }
 
 private:
@@ -650,8 +642,8 @@ std::optional<std::string> CheckLmdbLockFile(const std::string& dir, bool caller
 }
 
 std::string LmdbFailureText(const std::string& dir, int rc, const std::string& text) {
-    if (rc == ENOSPC) {
-        return "no space left on device";
+    if (rc == ENOSPC || rc == EDQUOT) {
+        return SystemErrorText(rc);
     }
     if (rc != EIO) {
         return text;

@@ -6,7 +6,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdlib>
-#include <cstring>
+
+#include "tnUtils/FileIo.h"
 
 namespace tarn {
 
@@ -18,9 +19,7 @@ std::string TempDirectory() {
 }
 
 [[noreturn]] void Failed(const std::string& doing, int error) {
-    throw RuntimeError(doing + ": " +
-                       (error == ENOSPC || error == EDQUOT ? std::string("no space left on device")
-                                                           : std::strerror(error)));
+    throw RuntimeError(doing + ": " + SystemErrorText(error));
 }
 
 // An unlinked temporary file, open for reading and writing.
@@ -35,29 +34,15 @@ int MakeTempFile() {
 }
 
 void WriteAll(int fd, const octet_t* bytes, std::size_t size, uint64 offset) {
-    for (std::size_t done = 0; done < size;) {
-        const ssize_t n =
-            ::pwrite(fd, bytes + done, size - done, static_cast<off_t>(offset + done));
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            Failed("writing the overlay's temporary file", errno);
-        }
-        done += static_cast<std::size_t>(n);
+    if (const int error = WriteAt(fd, bytes, size, offset)) {
+        Failed("writing the overlay's temporary file", error);
     }
 }
 
 void ReadAll(int fd, octet_t* bytes, std::size_t size, uint64 offset) {
-    for (std::size_t done = 0; done < size;) {
-        const ssize_t n = ::pread(fd, bytes + done, size - done, static_cast<off_t>(offset + done));
-        if (n <= 0) {
-            if (n < 0 && errno == EINTR) {
-                continue;
-            }
-            Failed("reading the overlay's temporary file", n < 0 ? errno : EIO);
-        }
-        done += static_cast<std::size_t>(n);
+    const ssize_t n = ReadAt(fd, bytes, size, offset);
+    if (n != static_cast<ssize_t>(size)) {
+        Failed("reading the overlay's temporary file", n < 0 ? errno : EIO);
     }
 }
 

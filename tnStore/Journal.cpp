@@ -15,6 +15,7 @@
 #include <utility>
 
 #include "tnUtils/Assert.h"
+#include "tnUtils/FileIo.h"
 #include "tnUtils/LittleEndian.h"
 #include "tnUtils/RuntimeError.h"
 #include "tnUtils/UniqueFd.h"
@@ -71,15 +72,8 @@ std::string JoinPath(const std::string& dir, const char* name) {
     return dir.back() == '/' ? dir + name : dir + "/" + name;
 }
 
-std::string ErrorText(int error) {
-    if (error == ENOSPC || error == EDQUOT) {
-        return "no space left on device";
-    }
-    return std::strerror(error);
-}
-
 [[noreturn]] void IoError(const std::string& path, const char* action, int error) {
-    throw RuntimeError("journal '" + path + "': cannot " + action + ": " + ErrorText(error));
+    throw RuntimeError("journal '" + path + "': cannot " + action + ": " + SystemErrorText(error));
 }
 
 [[noreturn]] void Damage(const std::string& path, uint64 offset, const std::string& what) {
@@ -100,16 +94,8 @@ uint32 RecordHeaderChecksum(const octet_t* header) {
 }
 
 void WriteAll(int fd, const octet_t* bytes, std::size_t size, uint64 at, const std::string& path) {
-    std::size_t done = 0;
-    while (done < size) {
-        const ssize_t n = ::pwrite(fd, bytes + done, size - done, static_cast<off_t>(at + done));
-        if (n < 0 && errno == EINTR) {
-            continue;
-        }
-        if (n <= 0) {
-            IoError(path, "write", n < 0 ? errno : EIO);
-        }
-        done += static_cast<std::size_t>(n);
+    if (const int error = WriteAt(fd, bytes, size, at)) {
+        IoError(path, "write", error);
     }
 }
 
@@ -443,7 +429,7 @@ void Journal::Reset(const std::string& dir, uint64 base, bool sync) {
         if (dirFd.Get() < 0 || ::fsync(dirFd.Get()) != 0) {
             const int error = errno;
             throw RuntimeError("journal '" + target + "': cannot sync directory '" + where +
-                               "': " + ErrorText(error));
+                               "': " + SystemErrorText(error));
         }
     }
 }

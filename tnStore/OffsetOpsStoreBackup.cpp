@@ -23,7 +23,6 @@
 #include <cerrno>
 #include <chrono>
 #include <condition_variable>
-#include <cstring>
 #include <filesystem>
 #include <limits>
 #include <mutex>
@@ -33,6 +32,7 @@
 #include "tnRuntime/LmdbStore.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnStore/StoreImpl.h"
+#include "tnUtils/FileIo.h"
 #include "tnUtils/UniqueFd.h"
 
 namespace tarn {
@@ -47,9 +47,7 @@ constexpr int kBackupAttempts = 8;
 constexpr auto kProgressInterval = std::chrono::milliseconds(200);
 
 [[noreturn]] void IoFailure(const std::string& path, const char* doing, int error) {
-    throw RuntimeError(std::string(doing) + " '" + path + "': " +
-                       (error == ENOSPC || error == EDQUOT ? std::string("no space left on device")
-                                                           : std::strerror(error)));
+    throw RuntimeError(std::string(doing) + " '" + path + "': " + SystemErrorText(error));
 }
 
 void SyncPath(const std::string& path, int flags) {
@@ -180,28 +178,17 @@ void CopyPrefix(int fd, const std::string& source, uint64 bytes, const std::stri
     for (uint64 at = 0; at < bytes;) {
         const std::size_t want =
             static_cast<std::size_t>(std::min<uint64>(buffer.size(), bytes - at));
-        const ssize_t got = ::pread(fd, buffer.data(), want, static_cast<off_t>(at));
+        const ssize_t got = ReadAt(fd, buffer.data(), want, at);
         if (got < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
             IoFailure(source, "reading", errno);
         }
-        if (got == 0) {
+        if (got < static_cast<ssize_t>(want)) {
             throw RuntimeError("journal '" + source + "' was cut while being copied");
         }
-        for (ssize_t written = 0; written < got;) {
-            const ssize_t n = ::write(out.Get(), buffer.data() + written,
-                                      static_cast<std::size_t>(got - written));
-            if (n < 0) {
-                if (errno == EINTR) {
-                    continue;
-                }
-                IoFailure(target, "writing", errno);
-            }
-            written += n;
+        if (const int error = WriteAt(out.Get(), buffer.data(), want, at)) {
+            IoFailure(target, "writing", error);
         }
-        at += static_cast<uint64>(got);
+        at += want;
     }
     if (::fsync(out.Get()) != 0) {
         IoFailure(target, "syncing", errno);
