@@ -31,7 +31,8 @@ void RequireSoundTree(OffsetOpsStore& store);
 std::string CacheTooSmall(ssize_t bound, ssize_t height);
 
 // Opens a store as a reader for a walk over all of it within `cacheObjects`
-// tree objects in memory (0: no bound), its tree checked. Returns nothing,
+// tree objects in memory (0: no bound); throws RuntimeError for a damaged
+// tree, which the store refuses to walk. Returns nothing,
 // having said why on `err`, when the bound is too small for the tree.
 std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheObjects,
                                           std::ostream& err);
