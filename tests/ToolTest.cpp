@@ -327,8 +327,8 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
          "'tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode' where"},
     };
     const std::vector<std::vector<std::string> > commands = {
-        {"show"},  {"show", "--field", "#1/"},     {"dump"}, {"validate"},
-        {"stats"}, {"record", "--generate", "10"}, {"clear"}};
+        {"show"},  {"show", "--field", "#1/"},     {"dump"},  {"validate"},
+        {"stats"}, {"record", "--generate", "10"}, {"clear"}, {"export"}};
     for (std::size_t d = 0; d < damages.size(); ++d) {
         const std::string store = dir.Sub("damaged" + std::to_string(d));
         fs::copy(base, store, fs::copy_options::recursive);
