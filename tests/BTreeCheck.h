@@ -160,6 +160,7 @@ public:
     std::optional<uint64> FindCounter(std::string_view name) override {
         return m_store.FindCounter(name);
     }
+    std::map<std::string, uint64> Counters() override { return m_store.Counters(); }
     uint64 NextIdentity() override { return m_store.NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
         m_lastWrites.clear();

@@ -316,19 +316,30 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
     // the image) that claims more bytes than the record holds.
     auto flip = [](std::string& file, std::size_t at) { file[at + 20] ^= 0x10; };
     auto cut = [](std::string& file, std::size_t at) { file[at - 1] = 1; };
-    // How to damage a store, and what the commands then name.
-    const std::vector<std::pair<std::function<void(const std::string&)>, std::string> > damages = {
-        {[&](auto& s) { DamageOnDisk(s, leaf, flip); },
-         "image #" + std::to_string(leaf) + ": checksum mismatch"},
-        {[&](auto& s) { DamageOnDisk(s, root, cut); },
-         "image #" + std::to_string(root) + ": truncated record"},
-        {[&](auto& s) { CopyImage(s, root, record); }, "where 'tarn::OffsetOps' was expected"},
-        {[&](auto& s) { CopyImage(s, leaf, root); },
-         "'tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode' where"},
-    };
+    // How to damage a store, and what the commands then name: a leaf image
+    // in the root's place is refused by the check of nodes as they load
+    // (lookups, walks) or by the whole-tree check (validate, dump, clear).
+    using ::testing::AnyOf;
+    const std::vector<
+        std::pair<std::function<void(const std::string&)>, ::testing::Matcher<std::string> > >
+        damages = {
+            {[&](auto& s) { DamageOnDisk(s, leaf, flip); },
+             HasSubstr("image #" + std::to_string(leaf) + ": checksum mismatch")},
+            {[&](auto& s) { DamageOnDisk(s, root, cut); },
+             HasSubstr("image #" + std::to_string(root) + ": truncated record")},
+            {[&](auto& s) { CopyImage(s, root, record); },
+             HasSubstr("where 'tarn::OffsetOps' was expected")},
+            {[&](auto& s) { CopyImage(s, leaf, root); },
+             AnyOf(HasSubstr("'tarn::FieldIdToOffsetOpsOnInt64FieldMapLeafNode' where"),
+                   HasSubstr("node #" + std::to_string(root) +
+                             " is a leaf where the root of a tree of height 1 needs an "
+                             "internal node at level 1"))},
+        };
+    // `stats` is not among them: it answers from the counts the store keeps
+    // and reads no node.
     const std::vector<std::vector<std::string> > commands = {
-        {"show"},  {"show", "--field", "#1/"},     {"dump"},  {"validate"},
-        {"stats"}, {"record", "--generate", "10"}, {"clear"}, {"export"}};
+        {"show"}, {"show", "--field", "#1/"},     {"dump"},  {"validate"},
+        {"record", "--generate", "10"}, {"clear"}, {"export"}};
     for (std::size_t d = 0; d < damages.size(); ++d) {
         const std::string store = dir.Sub("damaged" + std::to_string(d));
         fs::copy(base, store, fs::copy_options::recursive);
@@ -338,8 +349,7 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
             ToolRun run = Tool(args);
             EXPECT_EQ(run.status, 1) << ::testing::PrintToString(args) << run.err;
             EXPECT_THAT(run.err, OneLineWith("")) << ::testing::PrintToString(args);
-            EXPECT_THAT(run.out + run.err, HasSubstr(damages[d].second))
-                << ::testing::PrintToString(args);
+            EXPECT_THAT(run.out + run.err, damages[d].second) << ::testing::PrintToString(args);
         }
     }
 

@@ -106,6 +106,14 @@ ptr<IPersistable> CSpace::Resolve(OID oid, const ReflectedClass* expected) {
     // Load outside the mutex (the reader is the module's code), then enter
     // the object unless another shared holder entered it meanwhile.
     ptr<IPersistable> loaded = Load(oid, expected);
+    if (m_loadCheck != nullptr) {
+        try {
+            m_loadCheck->Loaded(*this, oid, loaded, expected);
+        } catch (...) {
+            DiscardUnregistered(loaded);
+            throw;
+        }
+    }
     std::lock_guard<std::mutex> lock(m_residentsMutex);
     auto it = m_residents.find(oid.value_);
     if (it != m_residents.end()) {
@@ -230,6 +238,7 @@ void CSpace::AdoptNew(ptr<IPersistable> obj) {
     state.SetFlag(DBP_PO_DIRTY);
     ++m_numDirty;
     ++m_stats.numRegistered;
+    ++m_populationDelta[obj->GetReflectedClass()->m_name];
 }
 
 void CSpace::QueueDirty(ptr<IPersistable> obj) {
@@ -254,6 +263,7 @@ void CSpace::QueueDeletion(ptr<IPersistable> obj, bool subTree) {
     if (!queued) {
         state.SetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION);
         ++m_numDeletions;
+        --m_populationDelta[obj->GetReflectedClass()->m_name];
     }
 }
 
@@ -347,6 +357,31 @@ std::optional<uint64> CSpace::GetCounter(std::string_view name) const {
         return it->second;
     }
     return m_store->FindCounter(name);
+}
+
+std::map<std::string, uint64> CSpace::CountersWithPrefix(std::string_view prefix) const {
+    std::map<std::string, uint64> found;
+    for (const auto& [name, value] : m_store->Counters()) {
+        if (name.starts_with(prefix)) {
+            found.emplace(name, value);
+        }
+    }
+    for (auto it = m_pendingCounters.lower_bound(prefix);
+         it != m_pendingCounters.end() && it->first.starts_with(prefix); ++it) {
+        found[it->first] = it->second;
+    }
+    return found;
+}
+
+std::string CSpace::PopulationCounter(std::string_view className) {
+    return "population:" + std::string(className);
+}
+
+int64 CSpace::Population(std::string_view className) const {
+    const int64 stored =
+        static_cast<int64>(GetCounter(PopulationCounter(className)).value_or(0));
+    auto it = m_populationDelta.find(className);
+    return stored + (it == m_populationDelta.end() ? 0 : it->second);
 }
 
 void CSpace::AttachExternalRef(SpaceRefLink* link) {

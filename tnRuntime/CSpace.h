@@ -45,6 +45,19 @@
 // resolve again, or keep a SpaceRef<T> (tnRuntime/SpaceRef.h), a reference
 // that the space tracks and unbinds like its residents' references.
 //
+// Checks at loading. A space may be given a LoadCheck: every object read
+// from the store is handed to it before it becomes resident, with the space's
+// residents around it, and a check that throws refuses the load (the object is
+// destroyed, the caller of Resolve receives the exception). The space knows
+// no class; the check knows what its objects must look like.
+//
+// Populations. The space counts, per class, the objects that exist in the
+// store once everything queued is committed: the stored count (the counter
+// "population:<class name>", kept by every commit) plus the objects
+// registered since, minus those queued for deletion since. A subtree deletion
+// is counted when the commit expands it, since only then are its objects
+// known. Counting costs constant time per registration and deletion.
+//
 // Costs. Registering, loading, marking, queueing a deletion and an object
 // leaving the space cost constant time (amortised; hash lookups), whatever
 // the number of residents, dirty objects or queued deletions. A commit costs
@@ -82,6 +95,18 @@ struct CSpaceStats {
     int64 numWritten = 0;  // images written by commits
     int64 numDeleted = 0;  // objects permanently deleted by commits
     int64 numEvicted = 0;  // clean residents released
+};
+
+// A check of objects as they are loaded (see "Checks at loading" above).
+class LoadCheck {
+public:
+    virtual ~LoadCheck() = default;
+    // `obj` was read from the image of `oid` and is not yet resident; the
+    // loader asked for an object of class `expected` (null: any class, which
+    // the space does not check). Throw RuntimeError to refuse it. May read
+    // residents of `space` (never load).
+    virtual void Loaded(const CSpace& space, OID oid, ptr<IPersistable> obj,
+                        const ReflectedClass* expected) = 0;
 };
 
 // The link between a SpaceRef and its space; the space nulls `space` when it
@@ -146,6 +171,16 @@ public:
     OID GetRoot(std::string_view name) const;
     std::map<std::string, OID> Roots() const;
 
+    // --- Checks and populations -------------------------------------------------
+
+    // The check every load goes through (null: none). Not owned; it must
+    // outlive the space or be reset first.
+    void SetLoadCheck(LoadCheck* check) { m_loadCheck = check; }
+    // The objects of class `className` once everything queued is committed,
+    // but for the objects below subtree deletions that are not expanded yet.
+    int64 Population(std::string_view className) const;
+    static std::string PopulationCounter(std::string_view className);
+
     // --- Named counters -------------------------------------------------------
 
     // Sets a named 64-bit counter (e.g. the journal position the changes up
@@ -155,6 +190,8 @@ public:
     // The counter's current value: set but not yet committed, else the
     // store's; nothing when it was never set.
     std::optional<uint64> GetCounter(std::string_view name) const;
+    // Every counter whose name starts with `prefix`, current values.
+    std::map<std::string, uint64> CountersWithPrefix(std::string_view prefix) const;
 
     // --- Commit and eviction (exclusive) --------------------------------------
 
@@ -212,7 +249,12 @@ private:
     Queued EntryOf(ptr<IPersistable> obj) const;
     // The resident object of the entry when it carries `flag`, else null.
     ptr<IPersistable> FlaggedResident(const Queued& entry, int flag) const;
-    void ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet);
+    void ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet,
+                         std::map<std::string, int64, std::less<>>& expandedDelta);
+    // The population counters a commit stores: every class whose count
+    // changed, with `expandedDelta` (the subtree deletions it expanded).
+    void AddPopulationCounters(CommitBatch& batch,
+                               const std::map<std::string, int64, std::less<>>& expandedDelta);
     void UnbindReferencesTo(const ObjectSet& objects);
     void DestroyDeleted(const std::vector<ptr<IPersistable>>& doomed);
 
@@ -235,6 +277,9 @@ private:
 
     ssize_t m_residentBound = 0;
     CSpaceStats m_stats;
+    LoadCheck* m_loadCheck = nullptr;
+    // Registrations minus deletions per class since the last commit.
+    std::map<std::string, int64, std::less<>> m_populationDelta;
 
     std::mutex m_externalRefsMutex;
     std::unordered_set<SpaceRefLink*> m_externalRefs;

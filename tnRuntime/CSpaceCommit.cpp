@@ -33,7 +33,11 @@ public:
 // a subtree deletion everything below it along VisitPrefs (resolved, and so
 // loaded, as needed). Each object once, in queue order and then depth first.
 // Entries of objects that left the space meanwhile are skipped.
-void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet) {
+// Objects found below a subtree deletion that were not queued themselves
+// leave the population here, in `expandedDelta`, which the commit applies
+// once the store has taken it (a failed commit expands again).
+void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet,
+                             std::map<std::string, int64, std::less<>>& expandedDelta) {
     std::vector<ptr<IPersistable>> pending;
     for (const Deletion& d : m_deletions) {
         ptr<IPersistable> queued = FlaggedResident(d.queued, DBP_PO_MARKED_DURING_ASYNC_DELETION);
@@ -64,6 +68,9 @@ void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& 
                 if (doomedSet.insert(child.m_self).second) {
                     doomed.push_back(child);
                     pending.push_back(child);
+                    if (!child->GetSysState().GetFlag(DBP_PO_MARKED_DURING_ASYNC_DELETION)) {
+                        --expandedDelta[child->GetReflectedClass()->m_name];
+                    }
                 }
             }
         }
@@ -85,7 +92,8 @@ void CSpace::Commit() {
 
     std::vector<ptr<IPersistable>> doomed;
     ObjectSet doomedSet;
-    ExpandDeletions(doomed, doomedSet);
+    std::map<std::string, int64, std::less<>> expandedDelta;
+    ExpandDeletions(doomed, doomedSet, expandedDelta);
 
     // The dirty objects in identity order. Each has one live entry: the
     // flag is set once per queueing and cleared only by a commit or when the
@@ -121,6 +129,7 @@ void CSpace::Commit() {
     std::sort(batch.deletes.begin(), batch.deletes.end());
     batch.roots = m_changedRoots;
     batch.counters.insert(m_pendingCounters.begin(), m_pendingCounters.end());
+    AddPopulationCounters(batch, expandedDelta);
     batch.nextIdentity = m_nextIdentity;
 
     m_store->Commit(batch);
@@ -143,6 +152,7 @@ void CSpace::Commit() {
     m_numDeletions = 0;
     m_changedRoots.clear();
     m_pendingCounters.clear();
+    m_populationDelta.clear();
     ++m_stats.numCommits;
     m_stats.numWritten += static_cast<int64>(dirty.size());
 
@@ -152,6 +162,22 @@ void CSpace::Commit() {
     }
     if (m_residentBound > 0 && NumResidents() > m_residentBound) {
         EvictCleanResidents(m_residentBound - m_residentBound / 4);
+    }
+}
+
+void CSpace::AddPopulationCounters(
+    CommitBatch& batch, const std::map<std::string, int64, std::less<>>& expandedDelta) {
+    std::map<std::string, int64, std::less<>> delta = m_populationDelta;
+    for (const auto& [name, d] : expandedDelta) {
+        delta[name] += d;
+    }
+    for (const auto& [name, d] : delta) {
+        if (d == 0) {
+            continue;
+        }
+        const std::string counter = PopulationCounter(name);
+        const int64 stored = static_cast<int64>(GetCounter(counter).value_or(0));
+        batch.counters[counter] = static_cast<uint64>(std::max<int64>(0, stored + d));
     }
 }
 

@@ -56,6 +56,8 @@ public:
     virtual std::map<std::string, uint64> Roots() = 0;
     // The named counter's value, or nothing when no commit has set it.
     virtual std::optional<uint64> FindCounter(std::string_view name) = 0;
+    // Every named counter the store holds.
+    virtual std::map<std::string, uint64> Counters() = 0;
     // The next identity to hand out (1 in a new store).
     virtual uint64 NextIdentity() = 0;
     virtual void Commit(const CommitBatch& batch) = 0;

@@ -555,6 +555,33 @@ std::map<std::string, uint64> LmdbStore::Roots() {
     return roots;
 }
 
+std::map<std::string, uint64> LmdbStore::Counters() {
+    std::lock_guard lock(m_mutex);
+    ReadScope read(*this);
+    int rc = 0;
+    Cursor cursor(read.Txn(), m_meta, &rc);
+    Check(rc, "listing the counters");
+    std::map<std::string, uint64> counters;
+    MDB_val key = Val(kCounterPrefix);
+    MDB_val value;
+    for (rc = cursor.Get(&key, &value, MDB_SET_RANGE); rc == MDB_SUCCESS;
+         rc = cursor.Get(&key, &value, MDB_NEXT)) {
+        const std::string_view name(static_cast<const char*>(key.mv_data), key.mv_size);
+        if (!name.starts_with(kCounterPrefix)) {
+            break;
+        }
+        if (value.mv_size != 8) {
+            Fail("damaged store: meta entry '" + std::string(name) + "' has " +
+                 std::to_string(value.mv_size) + " bytes, expected 8");
+        }
+        counters.emplace(name.substr(kCounterPrefix.size()), FromLe64(value));
+    }
+    if (rc != MDB_NOTFOUND && rc != MDB_SUCCESS) {
+        Check(rc, "listing the counters");
+    }
+    return counters;
+}
+
 std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);

@@ -37,6 +37,11 @@ std::optional<uint64> MemoryStore::FindCounter(std::string_view name) {
     return it->second;
 }
 
+std::map<std::string, uint64> MemoryStore::Counters() {
+    std::shared_lock<std::shared_mutex> lock(m_mutex);
+    return std::map<std::string, uint64>(m_counters.begin(), m_counters.end());
+}
+
 uint64 MemoryStore::NextIdentity() {
     std::shared_lock<std::shared_mutex> lock(m_mutex);
     return m_nextIdentity;

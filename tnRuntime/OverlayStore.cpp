@@ -139,6 +139,15 @@ std::optional<uint64> OverlayStore::FindCounter(std::string_view name) {
     return m_base->FindCounter(name);
 }
 
+std::map<std::string, uint64> OverlayStore::Counters() {
+    std::map<std::string, uint64> counters = m_base->Counters();
+    std::lock_guard lock(m_mutex);
+    for (const auto& [name, value] : m_counters) {
+        counters[name] = value;
+    }
+    return counters;
+}
+
 uint64 OverlayStore::NextIdentity() {
     {
         std::lock_guard lock(m_mutex);

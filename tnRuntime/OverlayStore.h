@@ -47,6 +47,7 @@ public:
     std::optional<uint64> FindRoot(std::string_view name) override;
     std::map<std::string, uint64> Roots() override;
     std::optional<uint64> FindCounter(std::string_view name) override;
+    std::map<std::string, uint64> Counters() override;
     uint64 NextIdentity() override;
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;

@@ -23,6 +23,7 @@ public:
     std::optional<uint64> FindCounter(std::string_view name) override {
         return m_inner->FindCounter(name);
     }
+    std::map<std::string, uint64> Counters() override { return m_inner->Counters(); }
     uint64 NextIdentity() override { return m_inner->NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
         m_inner->Commit(batch);

@@ -12,7 +12,7 @@
 #include "tnRuntime/OverlayStore.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnStore/StoreImpl.h"
-#include "tnStore/TreeWalk.h"
+#include "tnStore/TreeSummary.h"
 
 namespace tarn {
 
@@ -85,7 +85,7 @@ void CheckedRecord(OffsetOpsStore::Impl& s, const Opid& opid, const FieldId& fie
 // writer accepted every entry it journaled.
 void ReplayEntry(OffsetOpsStore::Impl& s, uint64 seq, const JournalEntry& e) {
     if (e.kind == JournalEntry::Kind::Clear) {
-        s.Record().Clear();
+        s.ClearRecord();
     } else {
         try {
             CheckedRecord(s, Opid(e.site, e.t), e.field, e.offset);
@@ -98,7 +98,10 @@ void ReplayEntry(OffsetOpsStore::Impl& s, uint64 seq, const JournalEntry& e) {
 }
 
 // The record of the space: the root's, or (writers of a store without one)
-// a new record, committed at once with the journal position 0.
+// a new record, committed at once with the journal position 0 and an empty
+// summary. Only a store without any image is given a new record: one that
+// holds images but names no record lost its root, and a new record would
+// orphan the stored tree.
 void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
     CSpace& space = *s.space;
     OID oid = space.GetRoot(kRecordRoot);
@@ -106,41 +109,42 @@ void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
         if (s.reader) {
             throw RuntimeError("store '" + s.dir + "' holds no offsets record yet");
         }
+        if (std::optional<uint64> largest = s.store->LargestIdentity()) {
+            throw RuntimeError("store '" + s.dir + "' is damaged: it holds images (up to #" +
+                               std::to_string(*largest) +
+                               ") but names no offsets record; run 'offsetops validate'");
+        }
         CSpaceGuard guard(space, LockMode::Exclusive);
         OffsetOps* created = CreatePersistent<OffsetOps>();
         oid = created->GetPersistObjState().m_oid;
         space.SetRoot(kRecordRoot, oid);
         space.SetCounter(kJournalPositionCounter, 0);
-        space.Commit();
+        SetTreeSummary(space, RefusalBounds());
+        s.CommitSpace();
     }
     s.record = std::make_unique<SpaceRef<OffsetOps>>(space, oid);
     CSpaceGuard guard(space, LockMode::Exclusive);
-    // Loads the record and its map now, so that a root of another class or a
-    // damaged image is reported before anything else happens.
+    // Loads the record and its map's header now, so that a root of another
+    // class or a damaged image is reported before anything else happens.
+    // The nodes are checked as they load.
+    s.loadCheck.SetMap(s.Record().m_map.m_oid);
     (void)s.Map();
 }
 
-// Checks the stored tree before anything walks it: the map's own code
-// trusts every node to be what its level says. On a sound tree, takes the
-// refusal bounds from every table.
-void CheckStoredTree(OffsetOpsStore::Impl& s) {
+// The refusal bounds and node counts kept with the last checkpoint. A store
+// from before they were kept has its tree walked once: a writer commits what
+// the walk found at once (the upgrade: counters only, no image changes), a
+// reader keeps it in memory.
+void LoadSummary(OffsetOpsStore::Impl& s) {
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.openCheck = CheckTree(s);
-    s.bounds = RefusalBounds();
-    if (s.openCheck.Ok()) {
-        WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
-                 [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
-                     for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
-                         for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                             s.bounds.NoteStored(site, so);
-                         }
-                     }
-                 });
+    if (LoadTreeSummary(*s.space, s.bounds)) {
+        return;
     }
-    if (!s.reader && !s.openCheck.Ok()) {
-        throw RuntimeError("store '" + s.dir + "': the stored tree is damaged (" +
-                           std::to_string(s.openCheck.numProblems) + " problems; the first: " +
-                           s.openCheck.problems.front() + "); run 'offsetops validate' for all");
+    RebuildTreeSummary(s);
+    if (!s.reader) {
+        s.CommitSpace();
+        s.repairs.push_back("kept the tree's counts and bounds with the store (once, for a "
+                            "store made before they were kept)");
     }
     if (s.options.cacheObjects > 0) {
         s.space->EvictCleanResidents(s.options.cacheObjects / 2);
@@ -175,6 +179,7 @@ void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
         spaceStore = s.overlay;
     }
     s.space = std::make_unique<CSpace>(spaceStore);
+    s.space->SetLoadCheck(&s.loadCheck);
     s.checkpointed = s.space->GetCounter(kJournalPositionCounter).value_or(0);
 }
 
@@ -276,7 +281,7 @@ void OpenWriter(OffsetOpsStore::Impl& s) {
         Journal::Reset(s.dir, s.checkpointed, s.options.sync);
     }
     FindOrCreateRecord(s);
-    CheckStoredTree(s);
+    LoadSummary(s);
     OpenJournalForWriting(s, legacy && !fresh);
 }
 
@@ -295,16 +300,13 @@ void OpenReader(OffsetOpsStore::Impl& s) {
         OpenSpace(s, OpenLmdb(s));
         const bool legacy = !s.space->GetCounter(kJournalPositionCounter).has_value();
         FindOrCreateRecord(s);
-        CheckStoredTree(s);
+        LoadSummary(s);
         std::error_code ec;
         if (!fs::exists(path, ec)) {
             if (legacy) {
                 return;
             }
             throw MissingJournal(s, path);
-        }
-        if (!s.openCheck.Ok()) {
-            return;  // nothing is replayed into a damaged tree
         }
         s.replayed = 0;
         try {
@@ -370,12 +372,25 @@ void OffsetOpsStore::Impl::RequireWritable() const {
     }
 }
 
-void OffsetOpsStore::Impl::RequireSoundTree() const {
-    if (!openCheck.Ok()) {
-        throw RuntimeError("store '" + dir + "': the stored tree is damaged (" +
-                           std::to_string(openCheck.numProblems) + " problems; the first: " +
-                           openCheck.problems.front() + "); run 'offsetops validate' for all");
-    }
+void OffsetOpsStore::Impl::CommitSpace() {
+    space->Commit();
+    cleared = ClearedNodes();
+}
+
+void OffsetOpsStore::Impl::ClearRecord() {
+    Record().Clear();
+    bounds.Clear();
+    const auto [leaves, internalNodes] = NodeCounts();
+    cleared.leaves += leaves;
+    cleared.internalNodes += internalNodes;
+}
+
+std::pair<int64, int64> OffsetOpsStore::Impl::NodeCounts() const {
+    const int64 leaves =
+        space->Population(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>().m_name);
+    const int64 internalNodes = space->Population(
+        GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>().m_name);
+    return {leaves - cleared.leaves, internalNodes - cleared.internalNodes};
 }
 
 // Before each operation: room for the most one operation can add. Clean
@@ -399,7 +414,7 @@ void OffsetOpsStore::Impl::MakeRoom() {
     if (space->NumResidents() > limit) {
         NotePeak();
         if (overlay != nullptr) {
-            space->Commit();
+            CommitSpace();
         }
         space->EvictCleanResidents(limit / 2);
     }
@@ -414,7 +429,8 @@ void OffsetOpsStore::Impl::WriteCheckpoint() {
     {
         CSpaceGuard guard(*space, LockMode::Exclusive);
         space->SetCounter(kJournalPositionCounter, durable);
-        space->Commit();
+        SetTreeSummary(*space, bounds);
+        CommitSpace();
         checkpointed = durable;
         ++checkpoints;
         NotePeak();
@@ -570,7 +586,7 @@ void OffsetOpsStore::Clear() {
     s.RequireWritable();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     try {
-        s.Record().Clear();
+        s.ClearRecord();
         if (s.journal != nullptr) {
             s.journal->AddClear();
         }

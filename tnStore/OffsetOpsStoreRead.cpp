@@ -40,10 +40,18 @@ StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
     return check;
 }
 
+void RequireSoundTree(OffsetOpsStore::Impl& s) {
+    const StoreCheck check = CheckTree(s);
+    if (!check.Ok()) {
+        throw RuntimeError("store '" + s.dir + "': the stored tree is damaged (" +
+                           std::to_string(check.numProblems) + " problems; the first: " +
+                           check.problems.front() + "); run 'offsetops validate' for all");
+    }
+}
+
 std::unique_ptr<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field) {
     Impl& s = *m_impl;
     s.RequireOpen();
-    s.RequireSoundTree();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.MakeRoom();
     const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
@@ -58,7 +66,6 @@ std::unique_ptr<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& fie
 void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
     Impl& s = *m_impl;
     s.RequireOpen();
-    s.RequireSoundTree();
     // A deque, since a table can be assigned but not copy-constructed into
     // a growing vector.
     std::deque<Entry> batch;
@@ -117,12 +124,7 @@ StoreStatistics OffsetOpsStore::Stats() {
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     stats.fields = s.Map().size();
     stats.height = s.Map().m_height;
-    if (s.openCheck.Ok()) {
-        const TreeShape shape =
-            WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects, {});
-        stats.leaves = shape.leaves;
-        stats.internalNodes = shape.internalNodes;
-    }
+    std::tie(stats.leaves, stats.internalNodes) = s.NodeCounts();
     const StoreStats stored = s.store->Stats();
     stats.images = stored.numImages;
     stats.imageBytes = stored.numImageBytes;
@@ -201,8 +203,8 @@ StoreValidation OffsetOpsStore::Validate() {
 void OffsetOpsStore::Dump(std::ostream& out) {
     Impl& s = *m_impl;
     s.RequireOpen();
-    s.RequireSoundTree();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    RequireSoundTree(s);
     OstreamOutputStream sink(out);
     xostream os(sink);
     s.Map().Write(os);

@@ -25,6 +25,7 @@
 #include "tnStore/CountingStore.h"
 #include "tnStore/Journal.h"
 #include "tnStore/OffsetOpsStore.h"
+#include "tnStore/TreeLoadCheck.h"
 
 namespace tarn {
 
@@ -33,12 +34,16 @@ namespace tarn {
 inline constexpr const char* kRecordRoot = "offsets";
 inline constexpr const char* kJournalPositionCounter = "journal-position";
 
-// Upper bounds on what the record's refusals depend on: the newest time
-// stamp of each site in any table, and the largest magnitude of any sum.
-// An operation whose stamp is not older than its site's newest and whose
-// offset cannot carry any sum past the 64-bit range can be refused for
-// nothing but its stamp's range, so Record skips looking up the field's
-// table for it. Clear leaves the bounds as they are: they stay upper bounds.
+// What the record's refusals depend on: the newest time stamp of each site in
+// any table, and an upper bound on the magnitude of every sum. An operation
+// whose stamp is not older than its site's newest and whose offset cannot
+// carry any sum past the 64-bit range can be refused for nothing but its
+// stamp's range, so Record skips looking up the field's table for it.
+//
+// Both are kept with every checkpoint (see TreeSummary) and brought forward
+// by recording and replay, so that opening never walks the tree for them.
+// The newest stamps are exact: a site's stamps for one field never go back,
+// and only Clear removes tables, which empties them.
 class RefusalBounds {
 public:
     bool RulesOutRefusal(const Opid& opid, int64 offset) const {
@@ -47,16 +52,24 @@ public:
                Magnitude(offset) <= kMaxSum - m_sum;
     }
     void Note(const Opid& opid, int64 offset) {
-        auto [it, added] = m_newest.emplace(opid.s, opid.t);
-        if (!added && it->second < opid.t) {
-            it->second = opid.t;
-        }
+        NoteStamp(opid.s, opid.t);
         m_sum = std::min(kMaxSum, m_sum + std::min(kMaxSum, Magnitude(offset)));
     }
+    // A table's record of one site, as a walk of the tree finds it.
     void NoteStored(const Guid& site, const SiteOffset<int64>& so) {
-        Note(Opid(site, so.t), 0);
+        NoteStamp(site, so.t);
         m_sum = std::min(kMaxSum, std::max(m_sum, Magnitude(so.o)));
     }
+    void NoteStamp(const Guid& site, int64 t) {
+        auto [it, added] = m_newest.emplace(site, t);
+        if (!added && it->second < t) {
+            it->second = t;
+        }
+    }
+    void SetSumBound(uint64 sum) { m_sum = std::min(kMaxSum, sum); }
+    uint64 SumBound() const { return m_sum; }
+    const std::map<Guid, int64>& Newest() const { return m_newest; }
+    void Clear() { *this = RefusalBounds(); }
 
 private:
     static constexpr uint64 kMaxSum = 9223372036854775807;
@@ -68,6 +81,14 @@ private:
     uint64 m_sum = 0;  // at least the magnitude of every sum, at most kMaxSum
 };
 
+// The numbers of the tree's nodes by class, as the space counts them, less
+// those of a tree Clear cut off and the next commit deletes (the space counts
+// those only when the commit expands the deletion).
+struct ClearedNodes {
+    int64 leaves = 0;
+    int64 internalNodes = 0;
+};
+
 struct OffsetOpsStore::Impl {
     std::string dir;  // "" for an in-memory store
     StoreOptions options;
@@ -75,6 +96,8 @@ struct OffsetOpsStore::Impl {
     bool broken = false;  // a write failed half way: no more writes
     bool closed = false;
 
+    // Declared before the space, which uses it until it is destroyed.
+    TreeLoadCheck loadCheck;
     std::shared_ptr<CountingStore> store;
     LmdbStore* lmdb = nullptr;  // under `store`, for on-disk stores
     // Bounded readers: between the space and `store`, taking the space's
@@ -89,15 +112,12 @@ struct OffsetOpsStore::Impl {
     int64 pending = 0;
     uint64 journalBytes = 0;  // readers: the journal bytes replayed
 
-    // The tree check made when the store was opened: readers refuse to walk a
-    // tree that failed it (writers refuse to open one).
-    StoreCheck openCheck;
-
     int64 checkpoints = 0;
     int64 replayed = 0;
     ssize_t peakResidents = 0;
     std::vector<std::string> repairs;
     RefusalBounds bounds;
+    ClearedNodes cleared;
 
     FieldIdToOffsetOpsOnInt64FieldMap& Map() { return *(*record)->m_map; }
     OffsetOps& Record() { return **record; }
@@ -105,8 +125,12 @@ struct OffsetOpsStore::Impl {
     // Throws when the handle is closed, or (for writes) a reader or broken.
     void RequireOpen() const;
     void RequireWritable() const;
-    // Throws RuntimeError when the tree failed the check made at opening.
-    void RequireSoundTree() const;
+    // Commits the space (to the store, or a bounded reader's overlay).
+    void CommitSpace();
+    // Clears the record (and what is kept about it). Exclusive.
+    void ClearRecord();
+    // The tree's leaves and internal nodes, without a walk.
+    std::pair<int64, int64> NodeCounts() const;
     // Releases clean residents so that one more operation fits under the
     // cache bound. Needs the space exclusively.
     void MakeRoom();
@@ -122,5 +146,8 @@ ssize_t OperationHeadroom(ssize_t height);
 // The non-aborting check of the store's tree, as the API reports it; within
 // the cache bound. Needs the space exclusively.
 StoreCheck CheckTree(OffsetOpsStore::Impl& s);
+// Throws RuntimeError unless the whole tree passes CheckTree: for the
+// operations that go over all of it and trust what they find (Dump, Clear).
+void RequireSoundTree(OffsetOpsStore::Impl& s);
 
 }  // namespace tarn
