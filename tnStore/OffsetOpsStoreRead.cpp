@@ -154,30 +154,67 @@ StoreCheck OffsetOpsStore::Check() {
     return check;
 }
 
+namespace {
+
+void AddProblem(FieldIdToOffsetOpsOnInt64FieldMapCheckResult& check, std::string problem) {
+    if (check.problems.size() < static_cast<std::size_t>(check.kMaxProblems)) {
+        check.problems.push_back(std::move(problem));
+    }
+    ++check.numProblems;
+}
+
+// The counts the store keeps (and opening and stats trust) against what the
+// walk found.
+void CompareKeptCounts(OffsetOpsStore::Impl& s,
+                       FieldIdToOffsetOpsOnInt64FieldMapCheckResult& check) {
+    const auto [leaves, internalNodes] = s.NodeCounts();
+    const auto compare = [&](const char* what, int64 kept, int64 found) {
+        if (kept != found) {
+            AddProblem(check, std::string("the store keeps a count of ") + std::to_string(kept) +
+                                  " " + what + ", the tree has " + std::to_string(found));
+        }
+    };
+    compare("leaves", leaves, check.leaves);
+    compare("internal nodes", internalNodes, check.internalNodes);
+    compare("fields", s.Map().size(), check.entries);
+}
+
+}  // namespace
+
 // The unreachable images are those of the store as it is (a reader's
 // snapshot, a writer's last checkpoint), so they are counted in a second
 // space over the same store, which holds no operation of the journal.
+// Within a cache bound the map's own validation is left out: it holds the
+// whole tree in memory, and the check above covers its invariants.
 StoreValidation OffsetOpsStore::Validate() {
     Impl& s = *m_impl;
     s.RequireOpen();
     StoreValidation v;
+    const ssize_t bound = s.options.cacheObjects;
     {
         CSpaceGuard guard(*s.space, LockMode::Exclusive);
         v.record = s.record->m_oid;
         v.map = s.Record().m_map.m_oid;
         const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
         FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
-            FieldIdToOffsetOpsOnInt64FieldMapCheck(map);
+            FieldIdToOffsetOpsOnInt64FieldMapCheck(map, [&] {
+                s.NotePeak();
+                KeepResidentsUnder(*s.space, bound);
+            });
         if (check.Ok()) {
+            CompareKeptCounts(s, check);
+        }
+        if (check.Ok() && bound > 0) {
+            v.mapValid = true;
+        } else if (check.Ok()) {
             // The map's own checker stops the process on a broken invariant,
             // so it runs only on a tree that passed the check above.
             map.Validate();
             v.mapValid = true;
             const ssize_t counted = map.GetNumNodes();
             if (counted != check.Nodes()) {
-                check.problems.push_back("the map counts " + std::to_string(counted) +
-                                         " nodes, the walk found " + std::to_string(check.Nodes()));
-                ++check.numProblems;
+                AddProblem(check, "the map counts " + std::to_string(counted) +
+                                      " nodes, the walk found " + std::to_string(check.Nodes()));
                 v.mapValid = false;
             }
         }
@@ -188,8 +225,8 @@ StoreValidation OffsetOpsStore::Validate() {
         }
     }
     CSpace stored(s.store);
-    CSpaceGuard guard(stored, LockMode::Shared);
-    ReachabilityResult reach = FindUnreachableImages(stored);
+    CSpaceGuard guard(stored, LockMode::Exclusive);
+    ReachabilityResult reach = FindUnreachableImages(stored, bound);
     v.images = reach.stored;
     v.reached = reach.reached;
     v.unreachable = std::move(reach.unreachable);

@@ -5,6 +5,7 @@
 
 #include "tnPersistStore/IPrefVisitor.h"
 #include "tnPersistStore/pref.h"
+#include "tnStore/TreeWalk.h"
 #include "tnUtils/RuntimeError.h"
 
 namespace tarn {
@@ -33,7 +34,7 @@ private:
 
 }  // namespace
 
-ReachabilityResult FindUnreachableImages(CSpace& space) {
+ReachabilityResult FindUnreachableImages(CSpace& space, ssize_t bound) {
     ReachabilityResult result;
     std::unordered_set<uint64> seen;
     std::deque<uint64> queue;
@@ -46,6 +47,7 @@ ReachabilityResult FindUnreachableImages(CSpace& space) {
         queue.pop_front();
         try {
             space.Resolve(OID(Seid(oid)), nullptr)->VisitPrefs(collector);
+            KeepResidentsUnder(space, bound);
         } catch (const RuntimeError& e) {
             result.errors.push_back(e.what());
         }

@@ -23,6 +23,8 @@ struct ReachabilityResult {
     std::vector<std::string> errors;  // objects that could not be loaded
 };
 
-ReachabilityResult FindUnreachableImages(CSpace& space);
+// Keeps at most `bound` objects resident (0: no bound); needs the space
+// exclusively when bounded.
+ReachabilityResult FindUnreachableImages(CSpace& space, ssize_t bound = 0);
 
 }  // namespace tarn

@@ -300,6 +300,8 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
     for (Command* cmd : {&dump, &validate, &stats, &clear}) {
         cmd->Option("--store", "DIR", "store directory");
     }
+    validate.Option("--cache-nodes", "C", walkCache);
+    validate.Flag("--no-progress", "accepted for symmetry with the other walks; validate shows none");
 
     try {
         try {
@@ -408,7 +410,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
             return RunDump(dump.Store(), out, err);
         }
         if (validate) {
-            return RunValidate(validate.Store(), out, err);
+            return RunValidate(validate.Store(), WalkSettingsOf(validate), out, err);
         }
         if (stats) {
             return RunStats(stats.Store(), out, err);

@@ -59,8 +59,8 @@ std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheO
         err << "offsetops: " << CacheTooSmall(cacheObjects, height) << '\n';
         return std::nullopt;
     }
-    // The store refuses to walk a tree that failed the check made when it
-    // opened: a walk that stops at once says so before anything is written.
+    // A walk that stops at once loads the path to the first leaf: damage on
+    // it is reported before anything is written.
     store.ForEach([](const FieldId&, const OffsetOpsOnField<int64>&) { return false; });
     return store;
 }

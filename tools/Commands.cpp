@@ -302,8 +302,13 @@ int RunDump(const std::string& store, std::ostream& out, std::ostream& err) {
     return 0;
 }
 
-int RunValidate(const std::string& store, std::ostream& out, std::ostream& err) {
-    OffsetOpsStore opened = OpenAndReport(store, StoreMode::Read, err);
+int RunValidate(const std::string& store, const WalkSettings& settings, std::ostream& out,
+                std::ostream& err) {
+    std::optional<OffsetOpsStore> walkable = OpenForWalk(store, settings.cacheObjects, err);
+    if (!walkable) {
+        return 1;
+    }
+    OffsetOpsStore& opened = *walkable;
     const StoreValidation v = opened.Validate();
     std::vector<std::string> problems = v.check.problems;
     int64 numProblems = v.check.numProblems;

@@ -106,7 +106,8 @@ int RunDump(const std::string& store, std::ostream& out, std::ostream& err);
 
 // The tree's invariants, the map's own validation, and the images no root
 // reaches. Status 0 only when all hold.
-int RunValidate(const std::string& store, std::ostream& out, std::ostream& err);
+int RunValidate(const std::string& store, const WalkSettings& settings, std::ostream& out,
+                std::ostream& err);
 
 // Counts of the store, its journal and the tree.
 int RunStats(const std::string& store, std::ostream& out, std::ostream& err);
