@@ -201,6 +201,15 @@ int64 FileBytes(const fs::path& path) {
     return ec ? 0 : static_cast<int64>(size);
 }
 
+// A copy rewrites every message about it to name the source store.
+RuntimeError AsSourceError(const std::string& dir, const fs::path& copy, const std::string& text) {
+    std::string what = text;
+    for (std::size_t at; (at = what.find(copy.string())) != std::string::npos;) {
+        what.replace(at, copy.string().size(), dir);
+    }
+    return RuntimeError("no backup made: " + what);
+}
+
 // Opens the copied data file as any opening does (which checks its pages
 // and makes its lock file, whose absence a later opening would report as a
 // repair), looks up every image in it and each root's (each image is
@@ -232,11 +241,31 @@ uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
         }
         return copied->FindCounter(kJournalPositionCounter).value_or(0);
     } catch (const RuntimeError& e) {
-        std::string what = e.what();
-        for (std::size_t at; (at = what.find(copy.string())) != std::string::npos;) {
-            what.replace(at, copy.string().size(), dir);
+        throw AsSourceError(dir, copy, e.what());
+    }
+}
+
+// The walks that check a copy keep at most this many tree objects in memory.
+constexpr ssize_t kCheckCacheObjects = 4096;
+
+// Opens the finished copy as a reader of it would (its meta values, its
+// record, its journal replayed onto the copied checkpoint) and checks the
+// whole of it: every node, the leaf chain, the counts it keeps, every image
+// reached. A copy that a reader could not use is no backup.
+void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
+    try {
+        StoreOptions options;
+        options.mode = StoreMode::Read;
+        options.cacheObjects = kCheckCacheObjects;
+        OffsetOpsStore copied = OffsetOpsStore::Open(copy.string(), options);
+        const StoreValidation v = copied.Validate();
+        if (!v.check.Ok()) {
+            throw RuntimeError("store '" + copy.string() + "': " +
+                               (v.check.problems.empty() ? std::string("damaged")
+                                                         : v.check.problems.front()));
         }
-        throw RuntimeError("no backup made: " + what);
+    } catch (const RuntimeError& e) {
+        throw AsSourceError(dir, copy, e.what());
     }
 }
 
@@ -315,6 +344,7 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
                                "checkpointed twice as each attempt began");
         }
     }
+    CheckCopyAsReader(dir, copy.Path());
     copy.MoveTo(target);
     return result;
 }
