@@ -59,6 +59,7 @@
 
 #include <cstddef>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <ostream>
@@ -158,6 +159,34 @@ struct StoreValidation {
     bool Ok() const { return check.Ok() && mapValid && unreachable.empty(); }
 };
 
+// A conflict between two replicas' records of one field and site: the same
+// time stamp with other sums (one replica saw only some of several offsets
+// that carry that stamp). A merge leaves the record as it is.
+struct MergeConflict {
+    FieldId field;
+    Guid site;
+    SiteOffset<int64> ours;    // in the store merged into
+    SiteOffset<int64> theirs;  // in the store merged from
+};
+
+struct MergeOptions {
+    // Find what would be taken and the conflicts; record nothing.
+    bool dryRun = false;
+    // The cache bound of the store merged from (0: none).
+    ssize_t cacheObjects = 0;
+    // A durable point after this many merged operations (and one at the end).
+    int64 durableEvery = 10000;
+    // Called for each conflict, in key order, as it is found.
+    std::function<void(const MergeConflict&)> onConflict;
+};
+
+struct MergeResult {
+    int64 fields = 0;      // fields of the store merged from
+    int64 taken = 0;       // site records taken from it (with a dry run: would be)
+    int64 operations = 0;  // operations recorded for them
+    int64 conflicts = 0;
+};
+
 struct BackupOptions {
     // Leave out free pages and renumber the rest (LMDB's compacting copy):
     // the copy is as small as its contents.
@@ -226,14 +255,34 @@ public:
     ssize_t Height();
     bool Empty() { return Size() == 0; }
 
-    // Counts the nodes by walking the tree (within the cache bound); on a
-    // damaged tree the node counts stay 0.
+    // Each site's newest time stamp in any table: what the store has seen of
+    // each site's stream (its version vector). Kept with every checkpoint and
+    // brought forward by replay: no walk.
+    std::map<Guid, int64> Sites();
+
+    // The counts the store keeps (fields, nodes, images) and this handle's
+    // figures; no walk.
     StoreStatistics Stats();
     StoreCheck Check();
     StoreValidation Validate();
     // The tree, node by node (after the check; throws RuntimeError on a
     // damaged tree).
     void Dump(std::ostream& out);
+
+    // --- Replicas (writers only) ---------------------------------------------------
+
+    // Joins the store in directory `from` (another replica, opened as a
+    // reader beside any writer of it) into this one: for every field and
+    // site, its record is taken where its time stamp is later than this
+    // store's (a site this store lacks counts as stamp -1). The same stamp
+    // with another sum is a conflict: reported, and this store's record
+    // kept. A record is taken through Record (its stamp, the difference of
+    // the sums; two operations when the difference would overflow), so the
+    // time-stamp rule holds, and it is journaled and made durable like any
+    // operation: after a crash this store holds exactly a durable point. Both
+    // stores are walked in key order, the one merged from within
+    // `options.cacheObjects`, this one within its own bound.
+    MergeResult Merge(const std::string& from, const MergeOptions& options = {});
 
     // --- Backups ----------------------------------------------------------------
 
