@@ -41,10 +41,19 @@
 // means fewer tree writes per operation and a longer replay when opening
 // after a crash (about a million operations a second).
 //
-// Damaged trees. Opening checks the stored tree (every node of the kind its
-// level needs, keys in order, counts in bounds, the leaf chain): a writer
-// refuses to open a damaged one, a reader opens it so that Check() and
-// Validate() can report, but refuses Find, the ForEach walks and Dump on it.
+// Opening reads the store's meta values and replays the journal's tail;
+// it walks neither the tree nor the file. What it needs to know about the
+// tree (the numbers of leaves and internal nodes, each site's newest time
+// stamp, a bound on every sum) is kept with each checkpoint and brought
+// forward by replay, so Stats() and Sites() read no node either.
+//
+// Damaged trees. Every node is checked where it is loaded: its image's
+// checksum (bound to its identity), its class against its level, its entry
+// count, its keys in order and within the bounds its parent gives it. A
+// lookup, walk or write that meets a damaged node throws RuntimeError (a
+// writer's handle is then broken, see Failures). Check() and Validate() walk
+// the whole tree, the leaf chain and the kept counts; Dump and Clear run the
+// whole-tree check first.
 //
 // Failures. Every failure is an exception derived from RuntimeError
 // (tnUtils/RuntimeError.h) whose what() is one line naming the file and what
