@@ -30,8 +30,8 @@ std::string Body(const std::string& exported) {
 std::string Unpacked(const ScratchDir& dir) {
     const std::string to = dir.Sub("fixture");
     fs::create_directories(to);
-    const std::string command = "tar -xJf '" + std::string(TARN_TEST_DATA_DIR) +
-                                "/store-format1.tar.xz' -C '" + to + "'";
+    const std::string command =
+        "tar -xJf '" + std::string(TARN_TEST_DATA_DIR) + "/store-format1.tar.xz' -C '" + to + "'";
     EXPECT_EQ(std::system(command.c_str()), 0) << command;
     return to;
 }

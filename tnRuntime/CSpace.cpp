@@ -378,8 +378,7 @@ std::string CSpace::PopulationCounter(std::string_view className) {
 }
 
 int64 CSpace::Population(std::string_view className) const {
-    const int64 stored =
-        static_cast<int64>(GetCounter(PopulationCounter(className)).value_or(0));
+    const int64 stored = static_cast<int64>(GetCounter(PopulationCounter(className)).value_or(0));
     auto it = m_populationDelta.find(className);
     return stored + (it == m_populationDelta.end() ? 0 : it->second);
 }

@@ -165,8 +165,8 @@ void CSpace::Commit() {
     }
 }
 
-void CSpace::AddPopulationCounters(
-    CommitBatch& batch, const std::map<std::string, int64, std::less<>>& expandedDelta) {
+void CSpace::AddPopulationCounters(CommitBatch& batch,
+                                   const std::map<std::string, int64, std::less<>>& expandedDelta) {
     std::map<std::string, int64, std::less<>> delta = m_populationDelta;
     for (const auto& [name, d] : expandedDelta) {
         delta[name] += d;

@@ -143,8 +143,9 @@ void LoadSummary(OffsetOpsStore::Impl& s) {
     RebuildTreeSummary(s);
     if (!s.reader) {
         s.CommitSpace();
-        s.repairs.push_back("kept the tree's counts and bounds with the store (once, for a "
-                            "store made before they were kept)");
+        s.repairs.push_back(
+            "kept the tree's counts and bounds with the store (once, for a "
+            "store made before they were kept)");
     }
     if (s.options.cacheObjects > 0) {
         s.space->EvictCleanResidents(s.options.cacheObjects / 2);

@@ -41,10 +41,19 @@
 // means fewer tree writes per operation and a longer replay when opening
 // after a crash (about a million operations a second).
 //
-// Damaged trees. Opening checks the stored tree (every node of the kind its
-// level needs, keys in order, counts in bounds, the leaf chain): a writer
-// refuses to open a damaged one, a reader opens it so that Check() and
-// Validate() can report, but refuses Find, the ForEach walks and Dump on it.
+// Opening reads the store's meta values and replays the journal's tail;
+// it walks neither the tree nor the file. What it needs to know about the
+// tree (the numbers of leaves and internal nodes, each site's newest time
+// stamp, a bound on every sum) is kept with each checkpoint and brought
+// forward by replay, so Stats() and Sites() read no node either.
+//
+// Damaged trees. Every node is checked where it is loaded: its image's
+// checksum (bound to its identity), its class against its level, its entry
+// count, its keys in order and within the bounds its parent gives it. A
+// lookup, walk or write that meets a damaged node throws RuntimeError (a
+// writer's handle is then broken, see Failures). Check() and Validate() walk
+// the whole tree, the leaf chain and the kept counts; Dump and Clear run the
+// whole-tree check first.
 //
 // Failures. Every failure is an exception derived from RuntimeError
 // (tnUtils/RuntimeError.h) whose what() is one line naming the file and what
@@ -59,6 +68,7 @@
 
 #include <cstddef>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <ostream>
@@ -158,6 +168,34 @@ struct StoreValidation {
     bool Ok() const { return check.Ok() && mapValid && unreachable.empty(); }
 };
 
+// A conflict between two replicas' records of one field and site: the same
+// time stamp with other sums (one replica saw only some of several offsets
+// that carry that stamp). A merge leaves the record as it is.
+struct MergeConflict {
+    FieldId field;
+    Guid site;
+    SiteOffset<int64> ours;    // in the store merged into
+    SiteOffset<int64> theirs;  // in the store merged from
+};
+
+struct MergeOptions {
+    // Find what would be taken and the conflicts; record nothing.
+    bool dryRun = false;
+    // The cache bound of the store merged from (0: none).
+    ssize_t cacheObjects = 0;
+    // A durable point after this many merged operations (and one at the end).
+    int64 durableEvery = 10000;
+    // Called for each conflict, in key order, as it is found.
+    std::function<void(const MergeConflict&)> onConflict;
+};
+
+struct MergeResult {
+    int64 fields = 0;      // fields of the store merged from
+    int64 taken = 0;       // site records taken from it (with a dry run: would be)
+    int64 operations = 0;  // operations recorded for them
+    int64 conflicts = 0;
+};
+
 struct BackupOptions {
     // Leave out free pages and renumber the rest (LMDB's compacting copy):
     // the copy is as small as its contents.
@@ -226,14 +264,34 @@ public:
     ssize_t Height();
     bool Empty() { return Size() == 0; }
 
-    // Counts the nodes by walking the tree (within the cache bound); on a
-    // damaged tree the node counts stay 0.
+    // Each site's newest time stamp in any table: what the store has seen of
+    // each site's stream (its version vector). Kept with every checkpoint and
+    // brought forward by replay: no walk.
+    std::map<Guid, int64> Sites();
+
+    // The counts the store keeps (fields, nodes, images) and this handle's
+    // figures; no walk.
     StoreStatistics Stats();
     StoreCheck Check();
     StoreValidation Validate();
     // The tree, node by node (after the check; throws RuntimeError on a
     // damaged tree).
     void Dump(std::ostream& out);
+
+    // --- Replicas (writers only) ---------------------------------------------------
+
+    // Joins the store in directory `from` (another replica, opened as a
+    // reader beside any writer of it) into this one: for every field and
+    // site, its record is taken where its time stamp is later than this
+    // store's (a site this store lacks counts as stamp -1). The same stamp
+    // with another sum is a conflict: reported, and this store's record
+    // kept. A record is taken through Record (its stamp, the difference of
+    // the sums; two operations when the difference would overflow), so the
+    // time-stamp rule holds, and it is journaled and made durable like any
+    // operation: after a crash this store holds exactly a durable point. Both
+    // stores are walked in key order, the one merged from within
+    // `options.cacheObjects`, this one within its own bound.
+    MergeResult Merge(const std::string& from, const MergeOptions& options = {});
 
     // --- Backups ----------------------------------------------------------------
 

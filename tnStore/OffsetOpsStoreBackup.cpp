@@ -260,9 +260,9 @@ void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
         OffsetOpsStore copied = OffsetOpsStore::Open(copy.string(), options);
         const StoreValidation v = copied.Validate();
         if (!v.check.Ok()) {
-            throw RuntimeError("store '" + copy.string() + "': " +
-                               (v.check.problems.empty() ? std::string("damaged")
-                                                         : v.check.problems.front()));
+            throw RuntimeError(
+                "store '" + copy.string() + "': " +
+                (v.check.problems.empty() ? std::string("damaged") : v.check.problems.front()));
         }
     } catch (const RuntimeError& e) {
         throw AsSourceError(dir, copy, e.what());

@@ -42,13 +42,16 @@ public:
     bool IsNode() const { return m_leaf != nullptr || m_internal != nullptr; }
     bool IsLeaf() const { return m_leaf != nullptr; }
     const InternalNode* Internal() const { return m_internal; }
-    ssize_t Count() const { return m_leaf != nullptr ? m_leaf->m_numKeyEntrys : m_internal->m_numKeyEntrys; }
+    ssize_t Count() const {
+        return m_leaf != nullptr ? m_leaf->m_numKeyEntrys : m_internal->m_numKeyEntrys;
+    }
     const FieldId& Key(ssize_t i) const {
         return m_leaf != nullptr ? m_leaf->GetEntry(i).first : m_internal->GetEntry(i).m_key;
     }
 
 private:
-    NodeView(const LeafNode* leaf, const InternalNode* internal) : m_leaf(leaf), m_internal(internal) {}
+    NodeView(const LeafNode* leaf, const InternalNode* internal)
+        : m_leaf(leaf), m_internal(internal) {}
     const LeafNode* m_leaf;
     const InternalNode* m_internal;
 };
@@ -115,9 +118,10 @@ void CheckHeader(OID oid, const Map& map) {
 
 void CheckClassForLevel(OID oid, const NodeView& node, ssize_t level, const std::string& where) {
     if (node.IsLeaf() != (level == 0)) {
-        Damaged(oid, std::string("is ") + (node.IsLeaf() ? "a leaf" : "an internal node") +
-                         " where " + where + " needs " +
-                         (level == 0 ? "a leaf" : "an internal node at level " + std::to_string(level)));
+        Damaged(oid,
+                std::string("is ") + (node.IsLeaf() ? "a leaf" : "an internal node") + " where " +
+                    where + " needs " +
+                    (level == 0 ? "a leaf" : "an internal node at level " + std::to_string(level)));
     }
 }
 
@@ -128,8 +132,8 @@ void CheckUnder(OID oid, const NodeView& node, const InternalNode& parent, OID p
                 ssize_t slot) {
     const std::string where = "its parent " + ToString(parentOid);
     if (node.Count() < kMinEntries) {
-        Damaged(oid, "holds " + std::to_string(node.Count()) + " entries below the root (" +
-                         where + "), fewer than " + std::to_string(kMinEntries));
+        Damaged(oid, "holds " + std::to_string(node.Count()) + " entries below the root (" + where +
+                         "), fewer than " + std::to_string(kMinEntries));
     }
     if (slot > 0 && CompareKeys(node.Key(0), parent.GetEntry(slot - 1).m_key) < 0) {
         Damaged(oid, "has the key " + ToString(node.Key(0)) + " below the bound " +
@@ -162,8 +166,8 @@ void TreeLoadCheck::Loaded(const CSpace& space, OID oid, ptr<IPersistable> obj,
     }
     const Map& map = *static_cast<const Map*>(header.m_self);
     if (map.m_root.m_oid == oid) {
-        CheckClassForLevel(oid, node, map.m_height, "the root of a tree of height " +
-                                                        std::to_string(map.m_height));
+        CheckClassForLevel(oid, node, map.m_height,
+                           "the root of a tree of height " + std::to_string(map.m_height));
         return;
     }
     if (node.Count() == 0 || map.m_height < 1) {

@@ -48,15 +48,15 @@ void SetTreeSummary(CSpace& space, const RefusalBounds& bounds) {
 
 void RebuildTreeSummary(OffsetOpsStore::Impl& s) {
     s.bounds.Clear();
-    const TreeShape shape = WalkTree(
-        *s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
-        [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
-            for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
-                for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                    s.bounds.NoteStored(site, so);
-                }
-            }
-        });
+    const TreeShape shape =
+        WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
+                 [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
+                     for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
+                         for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
+                             s.bounds.NoteStored(site, so);
+                         }
+                     }
+                 });
     CSpace& space = *s.space;
     const auto set = [&](const ReflectedClass& rc, int64 n) {
         space.SetCounter(CSpace::PopulationCounter(rc.m_name), static_cast<uint64>(n));

@@ -28,7 +28,8 @@ constexpr uint64 kMaxCacheNodes = 1'000'000'000;
 constexpr uint64 kMaxJournalMiB = uint64{1} << 20;
 constexpr uint64 kMaxLimit = INT64_MAX;
 
-const char* kCommands = "record, show, export, diff, backup, dump, validate, stats or clear";
+const char* kCommands =
+    "record, show, export, diff, backup, sites, merge, dump, validate, stats or clear";
 
 const char* kOpsHelp =
     "operations to record, one a line: site,t,oid,path,offset (site a Guid "
@@ -292,6 +293,21 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
     backup.Option("--to", "DIR", "the copy's directory: must not exist, or be empty");
     backup.Flag("--compact", "leave out free pages: the copy is as small as its contents");
     backup.Flag("--no-progress", "no progress line on a terminal");
+    Command sites(app, "sites",
+                  "print each site's newest time stamp: what the store has seen of each site");
+    sites.Option("--store", "DIR", "store directory");
+    Command merge(app, "merge",
+                  "take another replica's records wherever its time stamps are later; exit "
+                  "status 0 when merged, 1 when there were conflicts (left as they were), 2 on "
+                  "errors");
+    merge.Option("--store", "A", "the store merged into (its writer)");
+    merge.Option("--from", "B", "the store merged from (read beside any writer of it)");
+    merge.Flag("--dry-run", "print the conflicts and what would be taken; change nothing");
+    merge.Option("--cache-nodes", "C", walkCache + ", per store");
+    merge.Option("--commit-every", "K",
+                 "a durable point after every K merged operations (1 to " +
+                     std::to_string(kMaxCommitEvery) + ", default 10000)");
+    merge.Flag("--no-sync", "do not sync durable points to disk (scratch stores)");
     Command dump(app, "dump", "print the map's tree, node by node");
     Command validate(app, "validate",
                      "check the tree and the store; exit status 0 only when all holds");
@@ -301,7 +317,8 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
         cmd->Option("--store", "DIR", "store directory");
     }
     validate.Option("--cache-nodes", "C", walkCache);
-    validate.Flag("--no-progress", "accepted for symmetry with the other walks; validate shows none");
+    validate.Flag("--no-progress",
+                  "accepted for symmetry with the other walks; validate shows none");
 
     try {
         try {
@@ -323,8 +340,8 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
         if (app.get_subcommands().empty()) {
             throw UsageError{std::string("a command is needed: ") + kCommands, ""};
         }
-        for (const Command* cmd :
-             {&record, &show, &exportCmd, &diff, &backup, &dump, &validate, &stats, &clear}) {
+        for (const Command* cmd : {&record, &show, &exportCmd, &diff, &backup, &sites, &merge,
+                                   &dump, &validate, &stats, &clear}) {
             if (*cmd) {
                 cmd->RefuseExtras();
             }
@@ -406,6 +423,27 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
             return RunBackup(store, *to, backup.Flagged("--compact"), ProgressWanted(backup), out,
                              err);
         }
+        if (sites) {
+            return RunSites(sites.Store(), out, err);
+        }
+        if (merge) {
+            MergeCommand cmd;
+            cmd.store = merge.Store();
+            const std::optional<std::string> from = merge.Text("--from");
+            if (!from || from->empty()) {
+                throw UsageError{"merge needs --from B, the directory of the store to merge from",
+                                 "merge"};
+            }
+            cmd.from = *from;
+            cmd.dryRun = merge.Flagged("--dry-run");
+            cmd.cacheObjects = static_cast<ssize_t>(merge.Number(
+                "--cache-nodes", 0, kMaxCacheNodes, static_cast<uint64>(kDefaultWalkCacheObjects),
+                "0 (no bound) or a whole number up to " + std::to_string(kMaxCacheNodes)));
+            cmd.commitEvery =
+                static_cast<int64>(merge.Number("--commit-every", 1, kMaxCommitEvery, 10000));
+            cmd.sync = !merge.Flagged("--no-sync");
+            return RunMerge(cmd, out, err);
+        }
         if (dump) {
             return RunDump(dump.Store(), out, err);
         }
@@ -425,7 +463,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
     } catch (const std::exception& e) {
         err << "offsetops: error: " << e.what() << '\n';
     }
-    return diff ? 2 : 1;  // diff(1)'s convention: 1 means "they differ"
+    return diff || merge ? 2 : 1;  // diff(1)'s convention: 1 means "they differ"
 }
 
 }  // namespace tarn::tool

@@ -109,6 +109,28 @@ int RunDump(const std::string& store, std::ostream& out, std::ostream& err);
 int RunValidate(const std::string& store, const WalkSettings& settings, std::ostream& out,
                 std::ostream& err);
 
+// Each site's newest time stamp, one line each in site order:
+//   SITE NEWEST-STAMP
+int RunSites(const std::string& store, std::ostream& out, std::ostream& err);
+
+struct MergeCommand {
+    std::string store;  // merged into (its one writer)
+    std::string from;   // merged from (read beside any writer)
+    bool dryRun = false;
+    ssize_t cacheObjects = kDefaultWalkCacheObjects;  // for each store; 0: no bound
+    int64 commitEvery = 10000;                        // a durable point every K operations
+    bool sync = true;
+};
+
+// Takes into `store`, for every field and site, the record of `from` whose
+// stamp is later; prints each conflict (the same stamp with other sums,
+// left as it is in `store`), one line each:
+//   ! FIELD SITE (t,o-in-store) (t,o-in-from)
+// and nothing else on `out`; a summary follows on `err`. Status 0 when
+// merged without conflicts, 1 when there were conflicts (everything else
+// merged), 2 on any error.
+int RunMerge(const MergeCommand& cmd, std::ostream& out, std::ostream& err);
+
 // Counts of the store, its journal and the tree.
 int RunStats(const std::string& store, std::ostream& out, std::ostream& err);
 

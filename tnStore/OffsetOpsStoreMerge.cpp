@@ -1,0 +1,115 @@
+// Replicas: what a store has seen of each site, and joining another replica.
+//
+// Each site's operations reach every replica in that site's order, so a
+// replica's record of a field and a site is (the newest stamp it saw, the sum
+// of that site's offsets up to it): the later stamp covers the earlier, and
+// a merge needs the records only, not the operations.
+
+#include <filesystem>
+#include <limits>
+
+#include "tnStore/OffsetOpsStore.h"
+#include "tnStore/StoreImpl.h"
+
+namespace tarn {
+
+namespace {
+
+// The record of `site` in `table`, or stamp -1 and sum 0 when it has none.
+SiteOffset<int64> RecordOf(const OffsetOpsOnField<int64>* table, const Guid& site) {
+    if (table != nullptr) {
+        const auto& sites = table->m_map.getmap();
+        auto it = sites.find(site);
+        if (it != sites.end()) {
+            return it->second;
+        }
+    }
+    return SiteOffset<int64>();
+}
+
+// The next offset that moves `sum` toward `target` without overflow.
+int64 StepToward(int64 sum, int64 target) {
+    const __int128 diff = static_cast<__int128>(target) - sum;
+    if (diff > std::numeric_limits<int64>::max()) {
+        return std::numeric_limits<int64>::max();
+    }
+    if (diff < std::numeric_limits<int64>::min()) {
+        return std::numeric_limits<int64>::min();
+    }
+    return static_cast<int64>(diff);
+}
+
+}  // namespace
+
+std::map<Guid, int64> OffsetOpsStore::Sites() {
+    Impl& s = *m_impl;
+    s.RequireOpen();
+    return s.bounds.Newest();
+}
+
+MergeResult OffsetOpsStore::Merge(const std::string& from, const MergeOptions& options) {
+    Impl& s = *m_impl;
+    if (options.dryRun) {
+        s.RequireOpen();
+    } else {
+        s.RequireWritable();
+    }
+    std::error_code ec;
+    if (!s.dir.empty() && std::filesystem::equivalent(s.dir, from, ec)) {
+        throw RuntimeError("store '" + from + "' cannot be merged into itself");
+    }
+    StoreOptions reading;
+    reading.mode = StoreMode::Read;
+    reading.cacheObjects = options.cacheObjects;
+    OffsetOpsStore source = Open(from, reading);
+
+    MergeResult result;
+    int64 sinceDurable = 0;
+    source.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& theirs) {
+        ++result.fields;
+        const std::unique_ptr<OffsetOpsOnField<int64>> ours = Find(field);
+        for (const auto& [site, their] : theirs.m_map.getmap()) {
+            const SiteOffset<int64> our = RecordOf(ours.get(), site);
+            if (their.t < our.t) {
+                continue;  // ours covers theirs
+            }
+            if (their.t == our.t) {
+                if (their.o != our.o) {
+                    ++result.conflicts;
+                    if (options.onConflict) {
+                        options.onConflict(MergeConflict{field, site, our, their});
+                    }
+                }
+                continue;
+            }
+            ++result.taken;
+            if (options.dryRun) {
+                continue;
+            }
+            for (int64 sum = our.o; sum != their.o;) {
+                const int64 step = StepToward(sum, their.o);
+                Record(Opid(site, their.t), field, step);
+                sum += step;
+                ++result.operations;
+                ++sinceDurable;
+            }
+            if (our.o == their.o) {
+                // Equal sums under a later stamp: the stamp moves alone.
+                Record(Opid(site, their.t), field, 0);
+                ++result.operations;
+                ++sinceDurable;
+            }
+        }
+        if (sinceDurable >= options.durableEvery) {
+            Sync();
+            sinceDurable = 0;
+        }
+        return true;
+    });
+    if (!options.dryRun) {
+        Sync();
+    }
+    return result;
+}
+
+}  // namespace tarn
