@@ -27,7 +27,7 @@
 //      plus a child that does nothing, for the floor under every peak RSS.
 // Every case checks what it got (4 sites in the middle field's table, N
 // fields in the statistics, exit status 0 of the program) and fails its row
-// otherwise. The stores are removed once their size is done.
+// otherwise. The stores are removed once their size is done (unless --keep).
 //
 // The page cache holds the files when the cases run (they were just written
 // and are read again at every repetition): these are warm opens, as for a
@@ -73,6 +73,7 @@ struct Config {
     // The builder's StoreOptions::cacheObjects (0: no bound; -1: none up to
     // 10^6 fields, kLargeBuildCacheObjects above).
     ssize_t buildCacheObjects = -1;
+    bool keep = false;  // leave the stores in place, for a profiler
 };
 
 // ---- The fields ----------------------------------------------------------------
@@ -533,7 +534,7 @@ void PrintTable(const std::vector<Row>& rows, const std::vector<Size>& sizes, Op
 
 const char* kUsage =
     "usage: OpenJob [--max-fields N] [--sizes 10k,100k,1M,10M] [--repeat R] [--dir DIR]\n"
-    "               [--tool PATH | --no-tool] [--build-cache-objects C]\n"
+    "               [--tool PATH | --no-tool] [--build-cache-objects C] [--keep]\n"
     "Sizes above --max-fields (default 1M) are left out; 10M needs --max-fields 10M.\n"
     "Counts take k/M suffixes (1M, 10k).\n";
 
@@ -578,6 +579,8 @@ Config ParseArgs(int argc, char** argv) {
             config.tool = argv[++i];
         } else if (arg == "--build-cache-objects") {
             config.buildCacheObjects = static_cast<ssize_t>(count(i));
+        } else if (arg == "--keep") {
+            config.keep = true;
         } else if (arg == "--no-tool") {
             config.tool.clear();
         } else {
@@ -739,8 +742,12 @@ int Main(int argc, char** argv) {
                 }
             }
         }
-        RemoveDir(tarnDir);
-        RemoveDir(sqliteDir);
+        if (config.keep) {
+            std::fprintf(stderr, "kept %s and %s\n", tarnDir.c_str(), sqliteDir.c_str());
+        } else {
+            RemoveDir(tarnDir);
+            RemoveDir(sqliteDir);
+        }
         sizes.push_back(size);
     }
     std::printf("machine at end: %s\n", MachineLine().c_str());
