@@ -120,20 +120,6 @@ int64 OffsetOf(uint64 i, uint32 site) {
     return static_cast<int64>((i * 7 + site * 3) % 17) - 8;
 }
 
-// The 16 bytes of a site, in an order that sorts like the Guid.
-void SiteBytes(const Guid& g, octet_t* out) {
-    for (int i = 0; i < 4; ++i) {
-        out[i] = static_cast<octet_t>(g.Data1 >> (24 - 8 * i));
-    }
-    out[4] = static_cast<octet_t>(g.Data2 >> 8);
-    out[5] = static_cast<octet_t>(g.Data2);
-    out[6] = static_cast<octet_t>(g.Data3 >> 8);
-    out[7] = static_cast<octet_t>(g.Data3);
-    for (int i = 0; i < 8; ++i) {
-        out[8 + i] = static_cast<octet_t>(g.Data4[i]);
-    }
-}
-
 // ---- Building ----------------------------------------------------------------------
 
 struct BuildResult {
@@ -177,6 +163,20 @@ BuildResult BuildTarn(uint64 n, ssize_t cacheObjects, const std::string& dir) {
 }
 
 #ifdef TARN_BENCH_HAVE_SQLITE
+// The 16 bytes of a site, in an order that sorts like the Guid.
+void SiteBytes(const Guid& g, octet_t* out) {
+    for (int i = 0; i < 4; ++i) {
+        out[i] = static_cast<octet_t>(g.Data1 >> (24 - 8 * i));
+    }
+    out[4] = static_cast<octet_t>(g.Data2 >> 8);
+    out[5] = static_cast<octet_t>(g.Data2);
+    out[6] = static_cast<octet_t>(g.Data3 >> 8);
+    out[7] = static_cast<octet_t>(g.Data3);
+    for (int i = 0; i < 8; ++i) {
+        out[8 + i] = static_cast<octet_t>(g.Data4[i]);
+    }
+}
+
 std::string SqlitePath(const std::string& dir) {
     return dir + "/ops.sqlite";
 }
