@@ -69,6 +69,10 @@ struct Config {
     std::string dir;
     bool baseline = true;
     int64 sqliteCacheMiB = 256;
+    // The bounded subject, "tarn-bounded": a fixed bound, or the unbounded
+    // run's node count divided by cacheShare.
+    int64 cacheNodes = 0;
+    int64 cacheShare = 0;
 };
 
 // What a subject does per operation, at a durable point and at the end.
@@ -86,8 +90,8 @@ public:
 
 class TarnStoreSubject final : public Subject {
 public:
-    TarnStoreSubject(const std::string& dir, bool synced, uint32 sites)
-        : m_sites(MakeSites(sites)), m_store(Open(dir, synced)) {}
+    TarnStoreSubject(const std::string& dir, bool synced, uint32 sites, int64 cacheObjects = 0)
+        : m_sites(MakeSites(sites)), m_store(Open(dir, synced, cacheObjects)) {}
 
     void Record(const RawOp& op) override {
         m_store.Record(Opid(m_sites[op.site], op.t), OpStream::Field(op), op.offset);
@@ -99,16 +103,17 @@ public:
         char buf[256];
         std::snprintf(buf, sizeof buf,
                       "checkpoints %" PRId64 ", images written %" PRId64 " (%" PRId64
-                      " bytes), journal %" PRId64 " bytes, nodes %" PRId64,
+                      " bytes), journal %" PRId64 " bytes, nodes %" PRId64 ", peak residents %zd",
                       s.checkpoints, s.imagesWritten, s.imageBytesWritten, s.journalBytes,
-                      s.Nodes());
+                      s.Nodes(), s.peakResidents);
         return buf;
     }
 
 private:
-    static OffsetOpsStore Open(const std::string& dir, bool synced) {
+    static OffsetOpsStore Open(const std::string& dir, bool synced, int64 cacheObjects) {
         StoreOptions options;
         options.sync = synced;
+        options.cacheObjects = cacheObjects;
         return OffsetOpsStore::Open(dir, options);
     }
 
@@ -391,7 +396,7 @@ Contents ReadRocksdb(const std::string& dir) {
 #endif
 
 Contents ReadContents(const std::string& subject, const std::string& dir) {
-    if (subject == "tarn") {
+    if (subject == "tarn" || subject == "tarn-bounded") {
         return ReadTarn(dir);
     }
 #ifdef TARN_BENCH_HAVE_SQLITE
@@ -442,11 +447,15 @@ struct Case {
     std::string subject;
     uint64 every = 0;
     bool synced = false;
+    int64 cacheObjects = 0;  // tarn-bounded
 };
 
 std::unique_ptr<Subject> MakeSubject(const Config& config, const Case& c, const std::string& dir) {
     if (c.subject == "tarn") {
         return std::make_unique<TarnStoreSubject>(dir, c.synced, config.sites);
+    }
+    if (c.subject == "tarn-bounded") {
+        return std::make_unique<TarnStoreSubject>(dir, c.synced, config.sites, c.cacheObjects);
     }
 #ifdef TARN_BENCH_HAVE_SQLITE
     if (c.subject == "sqlite") {
@@ -551,7 +560,9 @@ const char* kUsage =
     "usage: MainJob [--ops N] [--fields F] [--sites S] [--seed X]\n"
     "               [--subjects tarn,sqlite,rocksdb] [--every 1000,10000,100000]\n"
     "               [--sync on,off] [--repeat R] [--dir DIR] [--no-baseline]\n"
-    "               [--sqlite-cache-mib M]\n"
+    "               [--sqlite-cache-mib M] [--cache-nodes C | --cache-share K]\n"
+    "--cache-nodes C adds tarn-bounded, the store bounded to C tree objects;\n"
+    "--cache-share K bounds it to the unbounded run's nodes / K (tarn must run).\n"
     "Counts take k/M suffixes (1M, 10k).\n";
 
 Config ParseArgs(int argc, char** argv) {
@@ -595,6 +606,10 @@ Config ParseArgs(int argc, char** argv) {
             config.seed = count(i);
         } else if (arg == "--repeat") {
             config.repeat = static_cast<int>(std::min<uint64>(count(i), 99));
+        } else if (arg == "--cache-nodes") {
+            config.cacheNodes = static_cast<int64>(count(i));
+        } else if (arg == "--cache-share") {
+            config.cacheShare = static_cast<int64>(count(i));
         } else if (arg == "--sqlite-cache-mib") {
             config.sqliteCacheMiB = static_cast<int64>(count(i));
         } else if (arg == "--subjects" && i + 1 < argc) {
@@ -634,6 +649,14 @@ Config ParseArgs(int argc, char** argv) {
     if (config.subjects.empty() || config.every.empty() || config.synced.empty()) {
         Usage(kUsage);
     }
+    if (config.cacheNodes > 0 || config.cacheShare > 0) {
+        const bool haveTarn = std::find(config.subjects.begin(), config.subjects.end(), "tarn") !=
+                              config.subjects.end();
+        if (config.cacheShare > 0 && !haveTarn) {
+            Usage(kUsage);
+        }
+        config.subjects.push_back("tarn-bounded");
+    }
     if (config.dir.empty()) {
         config.dir = DefaultStoreRoot("mainjob-stores");
     }
@@ -649,6 +672,20 @@ const Row* FindRow(const std::vector<Row>& rows, const std::string& subject, uin
         }
     }
     return nullptr;
+}
+
+// The bound of tarn-bounded: fixed, or the nodes of the unbounded run with
+// the same durability divided by the share.
+int64 BoundFor(const Config& config, const std::vector<Row>& rows, const Case& c) {
+    if (config.cacheShare <= 0) {
+        return config.cacheNodes;
+    }
+    const Row* t = FindRow(rows, "tarn", c.every, c.synced);
+    const char* nodes = t != nullptr ? std::strstr(t->runs.back().notes, "nodes ") : nullptr;
+    if (nodes == nullptr) {
+        throw std::runtime_error("--cache-share needs the unbounded tarn run first");
+    }
+    return std::max<int64>(std::strtoll(nodes + 6, nullptr, 10) / config.cacheShare, 64);
 }
 
 double Rate(const Config& config, const Row& row) {
@@ -687,6 +724,9 @@ int Main(int argc, char** argv) {
     for (int rep = 0; rep < config.repeat; ++rep) {
         for (Row& row : rows) {
             const std::string dir = config.dir + "/" + row.c.subject;
+            if (row.c.subject == "tarn-bounded") {
+                row.c.cacheObjects = BoundFor(config, rows, row.c);
+            }
             ::sync();  // earlier cases' dirty pages go to disk outside this case
             ChildOutcome<CaseResult> outcome = RunInChild<CaseResult>(
                 [&config, &row, &dir] { return RunCase(config, row.c, dir); });
@@ -757,27 +797,42 @@ int Main(int argc, char** argv) {
     std::printf(
         "\nRatios, tarn / peer (ops/s: higher is better for tarn; written/op, store, "
         "RSS: lower is better for tarn)\n\n");
-    std::printf("| peer | durable every | synced | ops/s | written/op | store | peak RSS |\n");
-    std::printf("| --- | ---: | --- | ---: | ---: | ---: | ---: |\n");
-    for (const std::string& peer : {std::string("sqlite"), std::string("rocksdb")}) {
-        for (uint64 every : config.every) {
-            for (bool synced : config.synced) {
-                const Row* t = FindRow(rows, "tarn", every, synced);
-                const Row* p = FindRow(rows, peer, every, synced);
-                if (t == nullptr || p == nullptr) {
-                    continue;
-                }
-                const CaseResult& a = t->Median();
-                const CaseResult& b = p->Median();
-                auto ratio = [](double x, double y) { return y == 0 ? 0.0 : x / y; };
-                std::printf(
-                    "| %s | %s | %s | %.3gx | %.3gx | %.3gx | %.3gx |\n", peer.c_str(),
-                    Thousands(static_cast<double>(every)).c_str(), synced ? "yes" : "no",
-                    ratio(b.seconds, a.seconds),
-                    ratio(static_cast<double>(a.writeBytes), static_cast<double>(b.writeBytes)),
-                    ratio(static_cast<double>(a.storeBytes), static_cast<double>(b.storeBytes)),
-                    ratio(static_cast<double>(a.peakRssKiB), static_cast<double>(b.peakRssKiB)));
+    std::printf(
+        "| subject | peer | durable every | synced | ops/s | written/op | store | peak RSS "
+        "|\n");
+    std::printf("| --- | --- | ---: | --- | ---: | ---: | ---: | ---: |\n");
+    for (const std::string subject : {"tarn", "tarn-bounded"}) {
+        for (const std::string peer : {"tarn", "sqlite", "rocksdb"}) {
+            if (peer == subject) {
+                continue;
             }
+            for (uint64 every : config.every) {
+                for (bool synced : config.synced) {
+                    const Row* t = FindRow(rows, subject, every, synced);
+                    const Row* p = FindRow(rows, peer, every, synced);
+                    if (t == nullptr || p == nullptr) {
+                        continue;
+                    }
+                    const CaseResult& a = t->Median();
+                    const CaseResult& b = p->Median();
+                    auto ratio = [](double x, double y) { return y == 0 ? 0.0 : x / y; };
+                    std::printf(
+                        "| %s | %s | %s | %s | %.3gx | %.3gx | %.3gx | %.3gx |\n", subject.c_str(),
+                        peer.c_str(), Thousands(static_cast<double>(every)).c_str(),
+                        synced ? "yes" : "no", ratio(b.seconds, a.seconds),
+                        ratio(static_cast<double>(a.writeBytes), static_cast<double>(b.writeBytes)),
+                        ratio(static_cast<double>(a.storeBytes), static_cast<double>(b.storeBytes)),
+                        ratio(static_cast<double>(a.peakRssKiB),
+                              static_cast<double>(b.peakRssKiB)));
+                }
+            }
+        }
+    }
+    for (const Row& row : rows) {
+        if (row.c.subject == "tarn-bounded") {
+            std::printf("\ntarn-bounded, durable every %s, %s: bound %" PRId64 " tree objects\n",
+                        Thousands(static_cast<double>(row.c.every)).c_str(),
+                        row.c.synced ? "synced" : "unsynced", row.c.cacheObjects);
         }
     }
 

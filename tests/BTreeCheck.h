@@ -167,6 +167,10 @@ public:
         for (const auto& w : batch.writes) {
             m_lastWrites.push_back(w.first);
         }
+        if (batch.streamedWrites) {
+            batch.streamedWrites(
+                [&](uint64 oid, const StoredImage&) { m_lastWrites.push_back(oid); });
+        }
         m_lastDeletes = batch.deletes;
         m_store.Commit(batch);
     }

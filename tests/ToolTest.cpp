@@ -178,11 +178,13 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
     std::vector<Case> cases = {
         {{},
          2,
-         "a command is needed: record, show, export, diff, backup, dump, validate, stats or clear" +
+         "a command is needed: record, show, export, diff, backup, sites, merge, dump, validate, "
+         "stats or clear" +
              help},
         {{"frobnicate"},
          2,
-         "unknown command 'frobnicate': use record, show, export, diff, backup, dump, validate, "
+         "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, "
+         "dump, validate, "
          "stats or"},
         {{"--bogus", "show"}, 2, "unknown option '--bogus': options follow the command" + help},
         {{"stats", "--store", store, "-x"}, 2, "option '-x' for stats (see 'offsetops stats --"},
@@ -338,8 +340,9 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
     // `stats` is not among them: it answers from the counts the store keeps
     // and reads no node.
     const std::vector<std::vector<std::string> > commands = {
-        {"show"}, {"show", "--field", "#1/"},     {"dump"},  {"validate"},
-        {"record", "--generate", "10"}, {"clear"}, {"export"}};
+        {"show"},     {"show", "--field", "#1/"},     {"dump"},
+        {"validate"}, {"record", "--generate", "10"}, {"clear"},
+        {"export"}};
     for (std::size_t d = 0; d < damages.size(); ++d) {
         const std::string store = dir.Sub("damaged" + std::to_string(d));
         fs::copy(base, store, fs::copy_options::recursive);

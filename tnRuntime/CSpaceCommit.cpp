@@ -109,18 +109,23 @@ void CSpace::Commit() {
     std::sort(dirty.begin(), dirty.end(),
               [](const auto& a, const auto& b) { return a.first < b.first; });
 
+    // Images are made one at a time as the store takes them, so that a
+    // commit of the whole tree holds one image in memory, not all of them.
     CommitBatch batch;
-    batch.writes.reserve(dirty.size());
-    MemoryOutputStream bytes;
-    auto ar = std::make_unique<Archive>(&bytes);
-    for (const auto& [oid, obj] : dirty) {
-        bytes.clear();
-        ar->ClearWriteBufferAndNumBytesWritten();
-        obj->Serialise(*ar);
-        ar->Flush();
-        StoredImage image{obj->GetReflectedClass()->m_name, bytes.bytes()};
-        batch.writes.emplace_back(oid, std::move(image));
-    }
+    batch.streamedWrites = [&dirty](const CommitBatch::ImageSink& sink) {
+        MemoryOutputStream bytes;
+        auto ar = std::make_unique<Archive>(&bytes);
+        StoredImage image;
+        for (const auto& [oid, obj] : dirty) {
+            bytes.clear();
+            ar->ClearWriteBufferAndNumBytesWritten();
+            obj->Serialise(*ar);
+            ar->Flush();
+            image.className = obj->GetReflectedClass()->m_name;
+            image.bytes = bytes.bytes();
+            sink(oid, image);
+        }
+    };
     for (const ptr<IPersistable>& obj : doomed) {
         if (!obj->GetSysState().GetFlag(DBP_GC_NOT_REGISTERED_IN_EXTENT)) {
             batch.deletes.push_back(obj->GetPersistObjState().m_oid.value_);

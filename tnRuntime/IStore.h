@@ -34,7 +34,15 @@ struct StoredImage {
 // writes and deletions in increasing identity order, each identity once; a
 // store accepts any order.
 struct CommitBatch {
+    using ImageSink = std::function<void(uint64 oid, const StoredImage& image)>;
+
     std::vector<std::pair<uint64, StoredImage>> writes;  // identity -> new image
+    // More writes, handed to the sink one at a time while the store applies
+    // the batch, after `writes`: for batches too large to hold in memory at
+    // once. It may be called more than once (a store that retries its
+    // transaction calls it again) and must give the same images each time;
+    // each identity at most once, and none also in `writes`.
+    std::function<void(const ImageSink&)> streamedWrites;
     std::vector<uint64> deletes;                         // identities to remove
     std::map<std::string, uint64> roots;                 // named roots to set
     std::map<std::string, uint64> counters;              // named counters to set

@@ -678,7 +678,8 @@ void LmdbStore::Commit(const CommitBatch& batch) {
     // deleted in one batch ends up without an image. Deleting an identity the
     // store has no image for is not an error.
     WriteTransaction([&](MDB_txn* txn) {
-        for (const auto& [oid, image] : batch.writes) {
+        const auto put = [&](uint64 oid, const StoredImage& image) {
+            TARN_ASSERT(oid != 0);
             const auto keyBytes = IdentityKey(oid);
             MDB_val key = Val(keyBytes.data(), keyBytes.size());
             MDB_val value{ImageRecordSize(image), nullptr};
@@ -686,6 +687,12 @@ void LmdbStore::Commit(const CommitBatch& batch) {
                 Check(rc, "commit: writing image " + OidText(oid));
             }
             EncodeImageRecord(oid, image, static_cast<octet_t*>(value.mv_data));
+        };
+        for (const auto& [oid, image] : batch.writes) {
+            put(oid, image);
+        }
+        if (batch.streamedWrites) {
+            batch.streamedWrites(put);
         }
         for (const uint64 oid : batch.deletes) {
             const auto keyBytes = IdentityKey(oid);

@@ -52,10 +52,16 @@ void MemoryStore::Commit(const CommitBatch& batch) {
     //    counters.
     std::vector<std::map<uint64, StoredImage>::node_type> nodes;
     nodes.reserve(batch.writes.size());
-    for (const auto& [oid, image] : batch.writes) {
+    const auto add = [&](uint64 oid, const StoredImage& image) {
         std::map<uint64, StoredImage> one;
         one.emplace(oid, image);
         nodes.push_back(one.extract(one.begin()));
+    };
+    for (const auto& [oid, image] : batch.writes) {
+        add(oid, image);
+    }
+    if (batch.streamedWrites) {
+        batch.streamedWrites(add);
     }
     std::unique_lock<std::shared_mutex> lock(m_mutex);
     std::map<std::string, uint64, std::less<>> roots = m_roots;

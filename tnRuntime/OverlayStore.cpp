@@ -90,6 +90,41 @@ void OverlayStore::Compact() {
     }
 }
 
+void OverlayStore::FlushIntoBase() {
+    std::lock_guard lock(m_mutex);
+    CommitBatch batch;
+    batch.deletes.assign(m_deleted.begin(), m_deleted.end());
+    batch.roots.insert(m_roots.begin(), m_roots.end());
+    batch.counters.insert(m_counters.begin(), m_counters.end());
+    batch.nextIdentity = m_nextIdentity ? *m_nextIdentity : m_base->NextIdentity();
+    std::vector<uint64> order;
+    order.reserve(m_images.size());
+    for (const auto& [oid, extent] : m_images) {
+        order.push_back(oid);
+    }
+    std::sort(order.begin(), order.end());
+    batch.streamedWrites = [&](const CommitBatch::ImageSink& sink) {
+        StoredImage image;
+        for (uint64 oid : order) {
+            const Extent& extent = m_images.at(oid);
+            image.className = m_classNames[extent.className];
+            image.bytes.resize(extent.size);
+            ReadAll(m_fd, image.bytes.data(), image.bytes.size(), extent.offset);
+            sink(oid, image);
+        }
+    };
+    m_base->Commit(batch);
+    m_images.clear();
+    m_deleted.clear();
+    m_roots.clear();
+    m_counters.clear();
+    m_nextIdentity.reset();
+    m_end = 0;
+    m_liveBytes = 0;
+    // The file's old bytes are garbage now; giving them back is a courtesy.
+    (void)::ftruncate(m_fd, 0);
+}
+
 std::optional<StoredImage> OverlayStore::Load(uint64 oid) {
     {
         std::lock_guard lock(m_mutex);
@@ -165,10 +200,16 @@ void OverlayStore::Commit(const CommitBatch& batch) {
     std::vector<std::pair<uint64, Extent>> written;
     written.reserve(batch.writes.size());
     uint64 end = m_end;
-    for (const auto& [oid, image] : batch.writes) {
+    const auto add = [&](uint64 oid, const StoredImage& image) {
         WriteAll(m_fd, image.bytes.data(), image.bytes.size(), end);
         written.emplace_back(oid, Extent{end, image.bytes.size(), ClassIndex(image.className)});
         end += image.bytes.size();
+    };
+    for (const auto& [oid, image] : batch.writes) {
+        add(oid, image);
+    }
+    if (batch.streamedWrites) {
+        batch.streamedWrites(add);
     }
     m_end = end;
     for (const auto& [oid, extent] : written) {

@@ -56,6 +56,12 @@ public:
     // The bytes of the temporary file.
     uint64 FileBytes();
 
+    // Commits everything the overlay holds (its images, streamed from the
+    // file in identity order, its deletions, roots, counters and identity
+    // counter) to the base as one commit, and empties the overlay. When the
+    // base's commit throws, the overlay is as it was.
+    void FlushIntoBase();
+
 private:
     struct Extent {
         uint64 offset;

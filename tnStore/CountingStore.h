@@ -26,11 +26,32 @@ public:
     std::map<std::string, uint64> Counters() override { return m_inner->Counters(); }
     uint64 NextIdentity() override { return m_inner->NextIdentity(); }
     void Commit(const CommitBatch& batch) override {
-        m_inner->Commit(batch);
-        for (const auto& [oid, image] : batch.writes) {
-            ++m_imagesWritten;
-            m_bytesWritten += static_cast<int64>(image.bytes.size());
+        int64 images = 0;
+        int64 bytes = 0;
+        const auto count = [&](const StoredImage& image) {
+            ++images;
+            bytes += static_cast<int64>(image.bytes.size());
+        };
+        if (!batch.streamedWrites) {
+            m_inner->Commit(batch);
+        } else {
+            // Counted as they pass; a store that retries streams them again.
+            CommitBatch counted = batch;
+            counted.streamedWrites = [&](const CommitBatch::ImageSink& sink) {
+                images = 0;
+                bytes = 0;
+                batch.streamedWrites([&](uint64 oid, const StoredImage& image) {
+                    count(image);
+                    sink(oid, image);
+                });
+            };
+            m_inner->Commit(counted);
         }
+        for (const auto& [oid, image] : batch.writes) {
+            count(image);
+        }
+        m_imagesWritten += images;
+        m_bytesWritten += bytes;
         ++m_commits;
     }
     void ForEachIdentity(const std::function<void(uint64)>& fn) override {

@@ -69,14 +69,36 @@ std::optional<RecordRefused> Refusal(const Opid& opid, const FieldId& field, int
 
 // Records one operation after the refusal checks; the caller holds the space
 // exclusively. When the bounds rule a refusal out, the field's table is not
-// looked up first.
+// looked up first, and a bounded store defers the operation.
+//
+// An operation is deferred only while the bound leaves room for a tree two
+// levels higher than now: one batch (256 operations per object of a bound of
+// at least 24) cannot grow a tree by three levels (from height h that takes
+// more than 2 * 50^(h+2) new fields), so applying it never outgrows the
+// bound. Past that height each operation is applied at once, and the one
+// that would take the tree past the bound is refused by MakeRoom before it
+// changes anything.
 void CheckedRecord(OffsetOpsStore::Impl& s, const Opid& opid, const FieldId& field, int64 offset) {
-    if (opid.t < 0 || opid.t > kMaxTimeStamp || !s.bounds.RulesOutRefusal(opid, offset)) {
+    const bool cleared =
+        opid.t >= 0 && opid.t <= kMaxTimeStamp && s.bounds.RulesOutRefusal(opid, offset);
+    if (cleared && s.deferLimit > 0 &&
+        s.options.cacheObjects >=
+            OffsetOpsStore::MinCacheObjects(std::max<ssize_t>(s.Map().m_height, 0) + 2)) {
+        s.deferred.push_back(DeferredOperation{opid, field, offset});
+        s.bounds.Note(opid, offset);
+        if (s.deferred.size() >= s.deferLimit) {
+            s.ApplyDeferred();
+        }
+        return;
+    }
+    s.ApplyDeferred();  // each field's operations keep their order
+    if (!cleared) {
         FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
         if (auto refusal = Refusal(opid, field, offset, map.rFind(field))) {
             throw *refusal;
         }
     }
+    s.MakeRoom();
     s.Record().RecordOffset(opid, field, offset);
     s.bounds.Note(opid, offset);
 }
@@ -120,7 +142,7 @@ void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
         space.SetRoot(kRecordRoot, oid);
         space.SetCounter(kJournalPositionCounter, 0);
         SetTreeSummary(space, RefusalBounds());
-        s.CommitSpace();
+        s.CommitDurably();
     }
     s.record = std::make_unique<SpaceRef<OffsetOps>>(space, oid);
     CSpaceGuard guard(space, LockMode::Exclusive);
@@ -142,7 +164,7 @@ void LoadSummary(OffsetOpsStore::Impl& s) {
     }
     RebuildTreeSummary(s);
     if (!s.reader) {
-        s.CommitSpace();
+        s.CommitDurably();
         s.repairs.push_back(
             "kept the tree's counts and bounds with the store (once, for a "
             "store made before they were kept)");
@@ -173,11 +195,14 @@ void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
     s.overlay.reset();
     s.store = std::make_shared<CountingStore>(std::move(store));
     std::shared_ptr<IStore> spaceStore = s.store;
-    if (s.reader && s.options.cacheObjects > 0) {
-        // A bounded reader commits what replaying the journal changed to an
-        // overlay of its own, so that it can release those objects too.
+    if (s.options.cacheObjects > 0) {
+        // A bounded store commits what it changed between checkpoints to an
+        // overlay of its own, so that it can release those objects too; a
+        // writer's checkpoint flushes the overlay into the store.
         s.overlay = std::make_shared<OverlayStore>(s.store);
         spaceStore = s.overlay;
+        s.deferLimit = static_cast<std::size_t>(s.options.cacheObjects) *
+                       StoreOptions::kDeferredPerCacheObject;
     }
     s.space = std::make_unique<CSpace>(spaceStore);
     s.space->SetLoadCheck(&s.loadCheck);
@@ -378,7 +403,37 @@ void OffsetOpsStore::Impl::CommitSpace() {
     cleared = ClearedNodes();
 }
 
+void OffsetOpsStore::Impl::CommitDurably() {
+    CommitSpace();
+    if (overlay != nullptr && !reader) {
+        overlay->FlushIntoBase();
+    }
+}
+
+void OffsetOpsStore::Impl::ApplyDeferred() {
+    if (deferred.empty()) {
+        return;
+    }
+    std::stable_sort(deferred.begin(), deferred.end(),
+                     [](const DeferredOperation& a, const DeferredOperation& b) {
+                         return a.field < b.field;
+                     });
+    std::size_t applied = 0;
+    try {
+        for (const DeferredOperation& op : deferred) {
+            MakeRoom();
+            Record().RecordOffset(op.opid, op.field, op.offset);
+            ++applied;
+        }
+    } catch (...) {
+        deferred.erase(deferred.begin(), deferred.begin() + static_cast<std::ptrdiff_t>(applied));
+        throw;
+    }
+    deferred.clear();
+}
+
 void OffsetOpsStore::Impl::ClearRecord() {
+    deferred.clear();  // Clear removes what they would have changed
     Record().Clear();
     bounds.Clear();
     const auto [leaves, internalNodes] = NodeCounts();
@@ -394,11 +449,11 @@ std::pair<int64, int64> OffsetOpsStore::Impl::NodeCounts() const {
     return {leaves - cleared.leaves, internalNodes - cleared.internalNodes};
 }
 
-// Before each operation: room for the most one operation can add. Clean
-// objects are released. A writer's changed objects of operations that are
-// not yet durable stay until the next durable point checkpoints them; a
-// bounded reader commits its changed objects to its overlay first, so that
-// they can be released as well.
+// Before each operation: room for the most one operation can add. The
+// changed objects are committed to the overlay (never to the store between
+// checkpoints: the store's tree may not hold operations the journal could
+// lose) and then the clean ones released, down to half the bound, so that
+// the bound holds at all times.
 void OffsetOpsStore::Impl::MakeRoom() {
     const ssize_t bound = options.cacheObjects;
     if (bound <= 0) {
@@ -429,9 +484,10 @@ void OffsetOpsStore::Impl::MakeRoom() {
 void OffsetOpsStore::Impl::WriteCheckpoint() {
     {
         CSpaceGuard guard(*space, LockMode::Exclusive);
+        ApplyDeferred();
         space->SetCounter(kJournalPositionCounter, durable);
         SetTreeSummary(*space, bounds);
-        CommitSpace();
+        CommitDurably();
         checkpointed = durable;
         ++checkpoints;
         NotePeak();
@@ -611,12 +667,7 @@ void OffsetOpsStore::Sync() {
         }
         s.durable += static_cast<uint64>(s.pending);
         s.pending = 0;
-        const bool journalFull =
-            s.journal != nullptr && s.journal->FileBytes() > s.options.journalLimitBytes;
-        const bool cacheFull = s.options.cacheObjects > 0 &&
-                               s.space->NumResidents() > s.options.cacheObjects &&
-                               s.space->NumDirty() > 0;
-        if (journalFull || cacheFull) {
+        if (s.journal != nullptr && s.journal->FileBytes() > s.options.journalLimitBytes) {
             s.WriteCheckpoint();
         }
     } catch (...) {

@@ -53,6 +53,7 @@ std::unique_ptr<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& fie
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     s.MakeRoom();
     const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
     if (table == nullptr) {
@@ -75,6 +76,7 @@ void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
         batch.clear();
         {
             CSpaceGuard guard(*s.space, LockMode::Exclusive);
+            s.ApplyDeferred();
             s.MakeRoom();
             const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
             auto it = inclusive ? map.lower_bound(key) : map.upper_bound(key);
@@ -107,6 +109,7 @@ int64 OffsetOpsStore::Size() {
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     return s.Map().size();
 }
 
@@ -114,6 +117,7 @@ ssize_t OffsetOpsStore::Height() {
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     return s.Map().m_height;
 }
 
@@ -122,6 +126,7 @@ StoreStatistics OffsetOpsStore::Stats() {
     s.RequireOpen();
     StoreStatistics stats;
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     stats.fields = s.Map().size();
     stats.height = s.Map().m_height;
     std::tie(stats.leaves, stats.internalNodes) = s.NodeCounts();
@@ -147,6 +152,7 @@ StoreCheck OffsetOpsStore::Check() {
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     StoreCheck check = CheckTree(s);
     if (s.options.cacheObjects > 0) {
         s.space->EvictCleanResidents(s.options.cacheObjects / 2);
@@ -193,6 +199,7 @@ StoreValidation OffsetOpsStore::Validate() {
     const ssize_t bound = s.options.cacheObjects;
     {
         CSpaceGuard guard(*s.space, LockMode::Exclusive);
+        s.ApplyDeferred();
         v.record = s.record->m_oid;
         v.map = s.Record().m_map.m_oid;
         const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
@@ -241,6 +248,7 @@ void OffsetOpsStore::Dump(std::ostream& out) {
     Impl& s = *m_impl;
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
     RequireSoundTree(s);
     OstreamOutputStream sink(out);
     xostream os(sink);

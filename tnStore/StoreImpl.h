@@ -89,6 +89,14 @@ struct ClearedNodes {
     int64 internalNodes = 0;
 };
 
+// An operation recorded but not yet applied to the tree (see
+// Impl::deferred).
+struct DeferredOperation {
+    Opid opid;
+    FieldId field;
+    int64 offset;
+};
+
 struct OffsetOpsStore::Impl {
     std::string dir;  // "" for an in-memory store
     StoreOptions options;
@@ -100,8 +108,9 @@ struct OffsetOpsStore::Impl {
     TreeLoadCheck loadCheck;
     std::shared_ptr<CountingStore> store;
     LmdbStore* lmdb = nullptr;  // under `store`, for on-disk stores
-    // Bounded readers: between the space and `store`, taking the space's
-    // commits (see MakeRoom).
+    // Bounded stores: between the space and `store`, taking the space's
+    // commits between checkpoints (see MakeRoom); a writer's checkpoint
+    // flushes it into `store`.
     std::shared_ptr<OverlayStore> overlay;
     std::unique_ptr<CSpace> space;
     std::unique_ptr<SpaceRef<OffsetOps>> record;
@@ -118,6 +127,15 @@ struct OffsetOpsStore::Impl {
     std::vector<std::string> repairs;
     RefusalBounds bounds;
     ClearedNodes cleared;
+    // Bounded stores: operations that the bounds show cannot be refused wait
+    // here (they are journaled already) and are applied in key order once
+    // there are deferLimit of them, or before anything reads or checkpoints
+    // the tree. Operations on different fields commute, and a stable sort by
+    // field keeps each field's operations in their order, so the tree ends as
+    // if they had been applied one by one; an operation the bounds cannot
+    // clear applies the waiting ones first and is checked against the tree.
+    std::vector<DeferredOperation> deferred;
+    std::size_t deferLimit = 0;
 
     FieldIdToOffsetOpsOnInt64FieldMap& Map() { return *(*record)->m_map; }
     OffsetOps& Record() { return **record; }
@@ -125,8 +143,14 @@ struct OffsetOpsStore::Impl {
     // Throws when the handle is closed, or (for writes) a reader or broken.
     void RequireOpen() const;
     void RequireWritable() const;
-    // Commits the space (to the store, or a bounded reader's overlay).
+    // Commits the space (to the store, or a bounded store's overlay).
     void CommitSpace();
+    // Commits the space and, for a bounded writer, flushes the overlay into
+    // the store: one store transaction holds everything changed since the
+    // last one.
+    void CommitDurably();
+    // Applies the deferred operations in key order. Exclusive.
+    void ApplyDeferred();
     // Clears the record (and what is kept about it). Exclusive.
     void ClearRecord();
     // The tree's leaves and internal nodes, without a walk.
