@@ -338,10 +338,12 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
                              "internal node at level 1"))},
         };
     // `stats` is not among them: it answers from the counts the store keeps
-    // and reads no node.
+    // and reads no node. The record touches the first leaf (field #1/).
+    const std::string firstField =
+        dir.Write("first-field.ops", "0123abcd-0000-4000-8000-0000000000ff,1,1,,1\n");
     const std::vector<std::vector<std::string> > commands = {
-        {"show"},     {"show", "--field", "#1/"},     {"dump"},
-        {"validate"}, {"record", "--generate", "10"}, {"clear"},
+        {"show"},     {"show", "--field", "#1/"},      {"dump"},
+        {"validate"}, {"record", "--ops", firstField}, {"clear"},
         {"export"}};
     for (std::size_t d = 0; d < damages.size(); ++d) {
         const std::string store = dir.Sub("damaged" + std::to_string(d));
