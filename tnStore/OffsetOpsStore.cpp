@@ -71,7 +71,9 @@ std::optional<RecordRefused> Refusal(const Opid& opid, const FieldId& field, int
 // exclusively. When the bounds rule a refusal out, the field's table is not
 // looked up first, and a bounded store defers the operation.
 //
-// An operation is deferred only while the bound leaves room for a tree two
+// An operation is deferred only once the tree has more nodes than the
+// bound (a tree that fits gains nothing from waiting operations), and only
+// while the bound leaves room for a tree two
 // levels higher than now: one batch (256 operations per object of a bound of
 // at least 24) cannot grow a tree by three levels (from height h that takes
 // more than 2 * 50^(h+2) new fields), so applying it never outgrows the
@@ -81,7 +83,7 @@ std::optional<RecordRefused> Refusal(const Opid& opid, const FieldId& field, int
 void CheckedRecord(OffsetOpsStore::Impl& s, const Opid& opid, const FieldId& field, int64 offset) {
     const bool cleared =
         opid.t >= 0 && opid.t <= kMaxTimeStamp && s.bounds.RulesOutRefusal(opid, offset);
-    if (cleared && s.deferLimit > 0 &&
+    if (cleared && s.deferLimit > 0 && s.TreeOutgrowsTheBound() &&
         s.options.cacheObjects >=
             OffsetOpsStore::MinCacheObjects(std::max<ssize_t>(s.Map().m_height, 0) + 2)) {
         s.deferred.push_back(DeferredOperation{opid, field, offset});
@@ -414,10 +416,9 @@ void OffsetOpsStore::Impl::ApplyDeferred() {
     if (deferred.empty()) {
         return;
     }
-    std::stable_sort(deferred.begin(), deferred.end(),
-                     [](const DeferredOperation& a, const DeferredOperation& b) {
-                         return a.field < b.field;
-                     });
+    std::stable_sort(
+        deferred.begin(), deferred.end(),
+        [](const DeferredOperation& a, const DeferredOperation& b) { return a.field < b.field; });
     std::size_t applied = 0;
     try {
         for (const DeferredOperation& op : deferred) {
@@ -439,6 +440,11 @@ void OffsetOpsStore::Impl::ClearRecord() {
     const auto [leaves, internalNodes] = NodeCounts();
     cleared.leaves += leaves;
     cleared.internalNodes += internalNodes;
+}
+
+bool OffsetOpsStore::Impl::TreeOutgrowsTheBound() const {
+    const auto [leaves, internalNodes] = NodeCounts();
+    return leaves + internalNodes > options.cacheObjects;
 }
 
 std::pair<int64, int64> OffsetOpsStore::Impl::NodeCounts() const {

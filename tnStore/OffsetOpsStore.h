@@ -100,7 +100,7 @@ struct StoreOptions {
     // A durable point checkpoints when the journal has grown past this.
     std::size_t journalLimitBytes = std::size_t{64} << 20;
     // At most this many tree objects (the record, the map's header and the
-    // nodes; a node of 100 fields from 4 sites takes about 15 KiB in memory)
+    // nodes; a node of 100 fields from 4 sites takes about 30 KiB in memory)
     // in memory at any time (0: no bound). Must leave room for one operation:
     // see MinCacheObjects(). Between checkpoints, the objects a bounded store
     // changed go to a temporary file of its own (unlinked, in TMPDIR) before
@@ -108,8 +108,9 @@ struct StoreOptions {
     // into the store. A bounded store also defers up to
     // kDeferredPerCacheObject operations per object of the bound (about 80
     // bytes each) and applies them in key order, so that a leaf loaded
-    // takes all its waiting operations at once: with C objects, memory is
-    // about C * (15 KiB + 20 KiB) on top of the program's own.
+    // takes all its waiting operations at once (only while the tree has more
+    // nodes than the bound): with C objects, memory is at most about
+    // C * (30 KiB + 20 KiB) on top of the program's own.
     ssize_t cacheObjects = 0;
     static constexpr std::size_t kDeferredPerCacheObject = 256;
 };

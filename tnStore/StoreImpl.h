@@ -155,6 +155,7 @@ struct OffsetOpsStore::Impl {
     void ClearRecord();
     // The tree's leaves and internal nodes, without a walk.
     std::pair<int64, int64> NodeCounts() const;
+    bool TreeOutgrowsTheBound() const;
     // Releases clean residents so that one more operation fits under the
     // cache bound. Needs the space exclusively.
     void MakeRoom();
