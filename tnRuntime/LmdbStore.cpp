@@ -20,10 +20,12 @@
 #include <vector>
 
 #include <lmdb.h>
+#include <xxhash.h>
 
 #include "tnRuntime/ImageRecord.h"
 #include "tnRuntime/LmdbFileCheck.h"
 #include "tnUtils/Assert.h"
+#include "tnUtils/LittleEndian.h"
 #include "tnUtils/UniqueFd.h"
 
 namespace tarn {
@@ -36,12 +38,23 @@ namespace fs = std::filesystem;
 
 constexpr const char* kImagesDb = "images";
 constexpr const char* kMetaDb = "meta";
+constexpr std::string_view kStateKey = "state";
+constexpr std::string_view kFormatMagic = "TARNSTOR";
+constexpr uint32 kFormatVersion = 2;
+// The meta record's layout (see LmdbStore.h): magic 8, version 4, identity
+// counter 8, image bytes 8, then the roots and the counters, each a count 4
+// and per entry a name length 2, the name and a value 8; the checksum 8 last.
+constexpr std::size_t kStateVersionOffset = 8;
+constexpr std::size_t kStateBodyOffset = 12;
+constexpr std::size_t kChecksumBytes = 8;
+constexpr std::size_t kEmptyStateBytes = kStateBodyOffset + 8 + 8 + 4 + 4 + kChecksumBytes;
+constexpr std::size_t kMaxNameBytes = 1024;
+// Format 1 kept each meta value under a key of its own, without a checksum.
+constexpr uint32 kFormat1 = 1;
 constexpr std::string_view kFormatKey = "format";
 constexpr std::string_view kNextIdentityKey = "next-identity";
 constexpr std::string_view kRootPrefix = "root:";
 constexpr std::string_view kCounterPrefix = "counter:";
-constexpr std::string_view kFormatMagic = "TARNSTOR";
-constexpr uint32 kFormatVersion = 1;
 // ForEachIdentity reads identities in chunks of this many, so that the
 // callback runs with no transaction open and may use the store itself.
 constexpr std::size_t kIdentityChunk = 1024;
@@ -79,28 +92,78 @@ uint64 IdentityOfKey(const MDB_val& key) {
     return oid;
 }
 
-std::array<octet_t, 8> Le64(uint64 value) {
-    std::array<octet_t, 8> bytes;
-    for (int i = 0; i < 8; ++i) {
-        bytes[i] = static_cast<octet_t>(value >> (8 * i));
-    }
-    return bytes;
+std::string_view Text(const MDB_val& val) {
+    return {static_cast<const char*>(val.mv_data), val.mv_size};
 }
 
-uint64 FromLe64(const MDB_val& val) {
-    const auto* bytes = static_cast<const octet_t*>(val.mv_data);
-    uint64 value = 0;
-    for (int i = 7; i >= 0; --i) {
-        value = (value << 8) | bytes[i];
-    }
-    return value;
+std::span<const octet_t> Bytes(const MDB_val& val) {
+    return {static_cast<const octet_t*>(val.mv_data), val.mv_size};
 }
 
-std::string MetaKey(std::string_view prefix, std::string_view name) {
-    std::string key(prefix);
-    key += name;
-    return key;
+// A name in the meta record; the caller adds what it names.
+void PutName(std::string& out, std::string_view name) {
+    TARN_ASSERT(name.size() <= kMaxNameBytes);
+    octet_t length[2];
+    PutLe(length, name.size(), 2);
+    out.append(reinterpret_cast<const char*>(length), 2);
+    out += name;
 }
+
+void PutValue(std::string& out, uint64 value, std::size_t width) {
+    octet_t bytes[8];
+    PutLe(bytes, value, width);
+    out.append(reinterpret_cast<const char*>(bytes), width);
+}
+
+// A meta record that does not parse; what is wrong.
+struct Unparsable {
+    std::string what;
+};
+
+// Reads a meta record's body front to back.
+class StateReader {
+public:
+    explicit StateReader(std::span<const octet_t> body) : m_body(body) {}
+
+    uint64 Value(std::size_t width, const char* what) {
+        return GetLe(Take(width, what).data(), width);
+    }
+
+    // The named values of one section (roots or counters), in strictly
+    // increasing name order.
+    void Section(std::map<std::string, uint64, std::less<>>& into, const char* what) {
+        const uint64 count = Value(4, what);
+        for (uint64 i = 0; i < count; ++i) {
+            const std::size_t length = Value(2, what);
+            if (length > kMaxNameBytes) {
+                throw Unparsable{std::string("a name of the ") + what + " has " +
+                                 std::to_string(length) + " bytes"};
+            }
+            const std::span<const octet_t> name = Take(length, what);
+            std::string key(reinterpret_cast<const char*>(name.data()), name.size());
+            if (!into.empty() && !(into.rbegin()->first < key)) {
+                throw Unparsable{std::string("the ") + what + " are out of order"};
+            }
+            const uint64 value = Value(8, what);
+            into.emplace_hint(into.end(), std::move(key), value);
+        }
+    }
+
+    std::size_t Left() const { return m_body.size() - m_at; }
+
+private:
+    std::span<const octet_t> Take(std::size_t size, const char* what) {
+        if (size > Left()) {
+            throw Unparsable{std::string("the record ends inside the ") + what};
+        }
+        const std::span<const octet_t> taken = m_body.subspan(m_at, size);
+        m_at += size;
+        return taken;
+    }
+
+    std::span<const octet_t> m_body;
+    std::size_t m_at = 0;
+};
 
 // The store directories open in this process, by device and inode. A child
 // made by fork() inherits the set but none of the stores in it (it must not
@@ -179,6 +242,87 @@ private:
 
 }  // namespace
 
+// The meta values of one commit: what the meta record holds.
+struct LmdbStoreState {
+    uint64 nextIdentity = 1;
+    uint64 imageBytes = 0;        // the sum of the sizes of all image records
+    bool imageBytesKnown = true;  // false for a format-1 store read as it is
+    std::map<std::string, uint64, std::less<>> roots;
+    std::map<std::string, uint64, std::less<>> counters;
+};
+
+namespace {
+
+[[noreturn]] void FailUnsupported(const std::string& dir, uint64 version) {
+    FailAt(dir, "store format version " + std::to_string(version) +
+                    " is not supported (this program reads versions 1 and 2)");
+}
+
+std::string NameTooLong(std::string_view name) {
+    return "the name has " + std::to_string(name.size()) + " bytes, more than the " +
+           std::to_string(kMaxNameBytes) + " a name may have";
+}
+
+// Takes a replaced or deleted record's size off the image bytes. The count
+// stays at zero or above even for records put into the images database
+// behind the store's back, which it never counted.
+void Uncount(LmdbStoreState& state, uint64 bytes) {
+    state.imageBytes -= std::min<uint64>(bytes, state.imageBytes);
+}
+
+std::string EncodeState(const LmdbStoreState& state) {
+    std::string out(kFormatMagic);
+    PutValue(out, kFormatVersion, 4);
+    PutValue(out, state.nextIdentity, 8);
+    PutValue(out, state.imageBytes, 8);
+    for (const auto* section : {&state.roots, &state.counters}) {
+        PutValue(out, section->size(), 4);
+        for (const auto& [name, value] : *section) {
+            PutName(out, name);
+            PutValue(out, value, 8);
+        }
+    }
+    PutValue(out, XXH3_64bits(out.data(), out.size()), 8);
+    return out;
+}
+
+// The meta record `record` of the store in `dir`, verified: its length, its
+// checksum, its magic and version, then its body.
+LmdbStoreState DecodeState(const std::string& dir, std::span<const octet_t> record) {
+    const std::string damaged = "damaged store: the meta record \"state\" ";
+    if (record.size() < kEmptyStateBytes) {
+        FailAt(dir, damaged + "has " + std::to_string(record.size()) + " bytes, fewer than the " +
+                        std::to_string(kEmptyStateBytes) + " of the smallest (wrong length)");
+    }
+    const std::size_t body = record.size() - kChecksumBytes;
+    if (XXH3_64bits(record.data(), body) != GetLe(record.data() + body, kChecksumBytes)) {
+        FailAt(dir, damaged + "does not match its checksum (checksum mismatch)");
+    }
+    if (!std::equal(kFormatMagic.begin(), kFormatMagic.end(), record.begin())) {
+        FailAt(dir, damaged + "lacks the magic \"TARNSTOR\"");
+    }
+    if (const uint64 version = GetLe(record.data() + kStateVersionOffset, 4);
+        version != kFormatVersion) {
+        FailUnsupported(dir, version);
+    }
+    LmdbStoreState state;
+    try {
+        StateReader reader(record.subspan(kStateBodyOffset, body - kStateBodyOffset));
+        state.nextIdentity = reader.Value(8, "identity counter");
+        state.imageBytes = reader.Value(8, "image bytes");
+        reader.Section(state.roots, "roots");
+        reader.Section(state.counters, "counters");
+        if (reader.Left() != 0) {
+            throw Unparsable{std::to_string(reader.Left()) + " bytes follow the counters"};
+        }
+    } catch (const Unparsable& e) {
+        FailAt(dir, damaged + "cannot be parsed: " + e.what);
+    }
+    return state;
+}
+
+}  // namespace
+
 // A read transaction for the length of one call: a writer's reader renewed
 // on entry and reset on exit, or a reader's snapshot, kept.
 class LmdbStore::ReadScope {
@@ -221,12 +365,16 @@ std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir,
     store->OpenDatabases(options.mode);
     if (store->m_readOnly) {
         store->BeginSnapshot();
+        *store->m_state = store->ReadState(store->m_reader, &store->m_foundVersion, nullptr);
     }
     return store;
 }
 
 LmdbStore::LmdbStore(std::string dir, const LmdbStoreOptions& options)
-    : m_dir(std::move(dir)), m_options(options), m_readOnly(options.mode == OpenMode::ReadOnly) {}
+    : m_dir(std::move(dir)),
+      m_options(options),
+      m_readOnly(options.mode == OpenMode::ReadOnly),
+      m_state(std::make_unique<LmdbStoreState>()) {}
 
 LmdbStore::~LmdbStore() {
     if (m_reader != nullptr) {
@@ -304,6 +452,9 @@ void LmdbStore::OpenEnvironment() {
     Check(mdb_reader_check(m_env, &dead), "clearing stale readers");
 }
 
+// Opens the two databases. A ReadOnly store reads its meta record from its
+// snapshot afterwards. A writer reads and verifies it here; it makes a new
+// store, and upgrades a format-1 store, in this same write transaction.
 void LmdbStore::OpenDatabases(OpenMode mode) {
     if (m_readOnly) {
         MDB_txn* txn = nullptr;
@@ -314,7 +465,6 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
                 Fail("not a store: the environment has no \"meta\" database");
             }
             Check(rc, "opening the meta database");
-            CheckFormat(txn);
             const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
             if (rcImages == MDB_NOTFOUND) {
                 Fail("damaged store: the \"images\" database is missing");
@@ -328,7 +478,11 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
         Check(mdb_txn_commit(txn), "opening the databases");
         return;
     }
+    LmdbStoreState state;
+    uint32 found = kFormatVersion;
+    bool upgraded = false;
     WriteTransaction([&](MDB_txn* txn) {
+        upgraded = false;
         const int rc = mdb_dbi_open(txn, kMetaDb, 0, &m_meta);
         if (rc == MDB_NOTFOUND) {
             if (mode != OpenMode::CreateIfMissing) {
@@ -346,50 +500,150 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             Check(mdb_dbi_open(txn, kMetaDb, MDB_CREATE, &m_meta), "creating the meta database");
             Check(mdb_dbi_open(txn, kImagesDb, MDB_CREATE, &m_images),
                   "creating the images database");
-            std::string format(kFormatMagic);
-            for (int i = 0; i < 4; ++i) {
-                format += static_cast<char>(kFormatVersion >> (8 * i));
-            }
-            MDB_val key = Val(kFormatKey);
-            MDB_val value = Val(format);
-            Check(mdb_put(txn, m_meta, &key, &value, 0), "writing the format marker");
-            const auto first = Le64(1);
-            key = Val(kNextIdentityKey);
-            value = Val(first.data(), first.size());
-            Check(mdb_put(txn, m_meta, &key, &value, 0), "writing the identity counter");
+            state = LmdbStoreState{};
+            found = kFormatVersion;
+            WriteState(txn, state);
             return;
         }
         Check(rc, "opening the meta database");
-        CheckFormat(txn);
         const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
         if (rcImages == MDB_NOTFOUND) {
             Fail("damaged store: the \"images\" database is missing");
         }
         Check(rcImages, "opening the images database");
+        std::vector<std::string> oldKeys;
+        state = ReadState(txn, &found, &oldKeys);
+        if (found == kFormat1) {
+            // The upgrade: the image bytes counted once, the meta values
+            // moved into the meta record, all in this transaction.
+            state.imageBytes = SumImageBytes(txn);
+            state.imageBytesKnown = true;
+            for (const std::string& old : oldKeys) {
+                MDB_val key = Val(old);
+                Check(mdb_del(txn, m_meta, &key, nullptr), "upgrading: removing '" + old + "'");
+            }
+            WriteState(txn, state);
+            upgraded = true;
+        }
     });
+    *m_state = std::move(state);
+    m_foundVersion = found;
+    if (upgraded) {
+        m_repairs.push_back(
+            "upgraded the store from format 1 to 2: its meta values are now "
+            "one record under a checksum");
+    }
 }
 
-void LmdbStore::CheckFormat(MDB_txn* txn) {
-    MDB_val key = Val(kFormatKey);
+// The meta values of the commit `txn` sees, verified, with the format found
+// in `version`. A format-1 store's values are read from their keys, which
+// `oldKeys` (when given) receives.
+LmdbStoreState LmdbStore::ReadState(MDB_txn* txn, uint32* version,
+                                    std::vector<std::string>* oldKeys) {
+    MDB_val key = Val(kStateKey);
     MDB_val value;
-    const int rc = mdb_get(txn, m_meta, &key, &value);
+    int rc = mdb_get(txn, m_meta, &key, &value);
+    if (rc == MDB_SUCCESS) {
+        *version = kFormatVersion;
+        return DecodeState(m_dir, Bytes(value));
+    }
+    if (rc != MDB_NOTFOUND) {
+        Check(rc, "reading the meta record");
+    }
+    // No meta record: a store of format 1, or one that lost its record.
+    key = Val(kFormatKey);
+    rc = mdb_get(txn, m_meta, &key, &value);
     if (rc == MDB_NOTFOUND) {
-        Fail("not a store: no format marker");
+        Fail(
+            "damaged store: the meta record \"state\" is missing (and there is no format-1 "
+            "marker)");
     }
     Check(rc, "reading the format marker");
-    const std::string_view marker(static_cast<const char*>(value.mv_data), value.mv_size);
+    const std::string_view marker = Text(value);
     if (marker.size() != kFormatMagic.size() + 4 || !marker.starts_with(kFormatMagic)) {
         Fail("not a store: unrecognised format marker");
     }
-    uint32 version = 0;
-    for (int i = 3; i >= 0; --i) {
-        version = (version << 8) | static_cast<unsigned char>(marker[kFormatMagic.size() + i]);
+    const uint64 markerVersion = GetLe(Bytes(value).data() + kFormatMagic.size(), 4);
+    if (markerVersion != kFormat1) {
+        FailUnsupported(m_dir, markerVersion);
     }
-    if (version != kFormatVersion) {
-        Fail("store format version " + std::to_string(version) +
-             " is not supported (this program " + "reads version " +
-             std::to_string(kFormatVersion) + ")");
+    *version = kFormat1;
+    return ReadFormat1(txn, oldKeys);
+}
+
+// A format-1 store's meta values, each under a key of its own. The image
+// bytes were not kept: they are counted on demand (or at the upgrade).
+LmdbStoreState LmdbStore::ReadFormat1(MDB_txn* txn, std::vector<std::string>* oldKeys) {
+    LmdbStoreState state;
+    state.imageBytesKnown = false;
+    bool haveNext = false;
+    int rc = 0;
+    Cursor cursor(txn, m_meta, &rc);
+    Check(rc, "reading the meta values");
+    MDB_val key;
+    MDB_val value;
+    for (rc = cursor.Get(&key, &value, MDB_FIRST); rc == MDB_SUCCESS;
+         rc = cursor.Get(&key, &value, MDB_NEXT)) {
+        const std::string_view name = Text(key);
+        const bool root = name.starts_with(kRootPrefix);
+        const bool counter = name.starts_with(kCounterPrefix);
+        const bool next = name == kNextIdentityKey;
+        if (!root && !counter && !next) {
+            if (name == kFormatKey && oldKeys != nullptr) {
+                oldKeys->emplace_back(name);
+            }
+            continue;
+        }
+        if (value.mv_size != 8) {
+            Fail("damaged store: meta entry '" + std::string(name) + "' has " +
+                 std::to_string(value.mv_size) + " bytes, expected 8");
+        }
+        const uint64 number = GetLe(Bytes(value).data(), 8);
+        if (next) {
+            state.nextIdentity = number;
+            haveNext = true;
+        } else if (root) {
+            state.roots.emplace(name.substr(kRootPrefix.size()), number);
+        } else {
+            state.counters.emplace(name.substr(kCounterPrefix.size()), number);
+        }
+        if (oldKeys != nullptr) {
+            oldKeys->emplace_back(name);
+        }
     }
+    if (rc != MDB_NOTFOUND) {
+        Check(rc, "reading the meta values");
+    }
+    if (!haveNext) {
+        Fail("damaged store: the identity counter is missing");
+    }
+    return state;
+}
+
+void LmdbStore::WriteState(MDB_txn* txn, const LmdbStoreState& state) {
+    const std::string record = EncodeState(state);
+    MDB_val key = Val(kStateKey);
+    MDB_val value = Val(record);
+    Check(mdb_put(txn, m_meta, &key, &value, 0), "writing the meta record");
+}
+
+// The sum of the sizes of all image records, from a walk of the images'
+// leaves (the records themselves are not read).
+uint64 LmdbStore::SumImageBytes(MDB_txn* txn) {
+    int rc = 0;
+    Cursor cursor(txn, m_images, &rc);
+    Check(rc, "measuring the images");
+    MDB_val key;
+    MDB_val value;
+    uint64 bytes = 0;
+    for (rc = cursor.Get(&key, &value, MDB_FIRST); rc == MDB_SUCCESS;
+         rc = cursor.Get(&key, &value, MDB_NEXT)) {
+        bytes += value.mv_size;
+    }
+    if (rc != MDB_NOTFOUND) {
+        Check(rc, "measuring the images");
+    }
+    return bytes;
 }
 
 // Runs `apply` in a write transaction and commits it; when the map fills
@@ -479,24 +733,6 @@ MDB_txn* LmdbStore::BeginRead() {
     }
 }
 
-uint64 LmdbStore::ReadMeta64(MDB_txn* txn, std::string_view key, bool* found) {
-    MDB_val k = Val(key);
-    MDB_val value;
-    const int rc = mdb_get(txn, m_meta, &k, &value);
-    *found = rc != MDB_NOTFOUND;
-    if (!*found) {
-        return 0;
-    }
-    if (rc != MDB_SUCCESS) {
-        Check(rc, "reading meta entry '" + std::string(key) + "'");
-    }
-    if (value.mv_size != 8) {
-        Fail("damaged store: meta entry '" + std::string(key) + "' has " +
-             std::to_string(value.mv_size) + " bytes, expected 8");
-    }
-    return FromLe64(value);
-}
-
 std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
     std::lock_guard lock(m_mutex);
     ReadScope read(*this);
@@ -519,51 +755,25 @@ std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
 
 std::optional<uint64> LmdbStore::FindRoot(std::string_view name) {
     std::lock_guard lock(m_mutex);
-    ReadScope read(*this);
-    bool found = false;
-    const uint64 oid = ReadMeta64(read.Txn(), MetaKey(kRootPrefix, name), &found);
-    if (!found) {
+    const auto it = m_state->roots.find(name);
+    if (it == m_state->roots.end()) {
         return std::nullopt;
     }
-    return oid;
+    return it->second;
 }
 
 std::map<std::string, uint64> LmdbStore::Roots() {
     std::lock_guard lock(m_mutex);
-    ReadScope read(*this);
-    int rc = 0;
-    Cursor cursor(read.Txn(), m_meta, &rc);
-    Check(rc, "listing the roots");
-    std::map<std::string, uint64> roots;
-    MDB_val key = Val(kRootPrefix);
-    MDB_val value;
-    for (rc = cursor.Get(&key, &value, MDB_SET_RANGE); rc == MDB_SUCCESS;
-         rc = cursor.Get(&key, &value, MDB_NEXT)) {
-        const std::string_view name(static_cast<const char*>(key.mv_data), key.mv_size);
-        if (!name.starts_with(kRootPrefix)) {
-            break;
-        }
-        if (value.mv_size != 8) {
-            Fail("damaged store: meta entry '" + std::string(name) + "' has " +
-                 std::to_string(value.mv_size) + " bytes, expected 8");
-        }
-        roots.emplace(name.substr(kRootPrefix.size()), FromLe64(value));
-    }
-    if (rc != MDB_NOTFOUND && rc != MDB_SUCCESS) {
-        Check(rc, "listing the roots");
-    }
-    return roots;
+    return {m_state->roots.begin(), m_state->roots.end()};
 }
 
 std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
     std::lock_guard lock(m_mutex);
-    ReadScope read(*this);
-    bool found = false;
-    const uint64 value = ReadMeta64(read.Txn(), MetaKey(kCounterPrefix, name), &found);
-    if (!found) {
+    const auto it = m_state->counters.find(name);
+    if (it == m_state->counters.end()) {
         return std::nullopt;
     }
-    return value;
+    return it->second;
 }
 
 // A read transaction on the latest commit. A writable store renews its
@@ -602,13 +812,19 @@ private:
 
 std::optional<uint64> LmdbStore::FindLatestCounter(std::string_view name) {
     std::lock_guard lock(m_mutex);
+    if (!m_readOnly) {
+        // The writer's own record is the latest.
+        const auto it = m_state->counters.find(name);
+        return it == m_state->counters.end() ? std::nullopt : std::optional(it->second);
+    }
     LatestRead read(*this);
-    bool found = false;
-    const uint64 value = ReadMeta64(read.Txn(), MetaKey(kCounterPrefix, name), &found);
-    if (!found) {
+    uint32 version = 0;
+    const LmdbStoreState latest = ReadState(read.Txn(), &version, nullptr);
+    const auto it = latest.counters.find(name);
+    if (it == latest.counters.end()) {
         return std::nullopt;
     }
-    return value;
+    return it->second;
 }
 
 void LmdbStore::CopyTo(const std::string& dir, bool compact) {
@@ -632,13 +848,7 @@ void LmdbStore::CopyTo(const std::string& dir, bool compact) {
 
 uint64 LmdbStore::NextIdentity() {
     std::lock_guard lock(m_mutex);
-    ReadScope read(*this);
-    bool found = false;
-    const uint64 next = ReadMeta64(read.Txn(), kNextIdentityKey, &found);
-    if (!found) {
-        Fail("damaged store: the identity counter is missing");
-    }
-    return next;
+    return m_state->nextIdentity;
 }
 
 void LmdbStore::Commit(const CommitBatch& batch) {
@@ -647,50 +857,64 @@ void LmdbStore::Commit(const CommitBatch& batch) {
         TARN_ASSERT(write.first != 0);
     }
     std::lock_guard lock(m_mutex);
+    // The new meta values are made in a copy, which replaces the store's
+    // once the transaction has committed: a failed commit leaves them as
+    // they were.
+    LmdbStoreState next;
     // Writes go first and deletions after them: an identity both written and
     // deleted in one batch ends up without an image. Deleting an identity the
     // store has no image for is not an error.
     WriteTransaction([&](MDB_txn* txn) {
+        next = *m_state;  // afresh whenever the transaction is run again
+        // The image bytes follow every change: the size of a record replaced
+        // or deleted is looked up first. That is one more descent of the tree
+        // per image, through the pages the write or the deletion then
+        // changes anyway, so it reads no page the commit would not read; the
+        // record itself (on its overflow pages, when large) is not read.
         for (const auto& [oid, image] : batch.writes) {
             const auto keyBytes = IdentityKey(oid);
             MDB_val key = Val(keyBytes.data(), keyBytes.size());
+            MDB_val old;
+            if (const int rc = mdb_get(txn, m_images, &key, &old); rc == MDB_SUCCESS) {
+                Uncount(next, old.mv_size);
+            } else if (rc != MDB_NOTFOUND) {
+                Check(rc, "commit: reading image " + OidText(oid));
+            }
             MDB_val value{ImageRecordSize(image), nullptr};
             if (const int rc = mdb_put(txn, m_images, &key, &value, MDB_RESERVE); rc != 0) {
                 Check(rc, "commit: writing image " + OidText(oid));
             }
             EncodeImageRecord(oid, image, static_cast<octet_t*>(value.mv_data));
+            next.imageBytes += value.mv_size;
         }
         for (const uint64 oid : batch.deletes) {
             const auto keyBytes = IdentityKey(oid);
             MDB_val key = Val(keyBytes.data(), keyBytes.size());
-            const int rc = mdb_del(txn, m_images, &key, nullptr);
-            if (rc != MDB_SUCCESS && rc != MDB_NOTFOUND) {
-                Check(rc, "commit: deleting image " + OidText(oid));
+            MDB_val old;
+            const int found = mdb_get(txn, m_images, &key, &old);
+            if (found == MDB_NOTFOUND) {
+                continue;
             }
-        }
-        for (const auto& [name, value] : batch.counters) {
-            const std::string counterKey = MetaKey(kCounterPrefix, name);
-            const auto bytes = Le64(value);
-            MDB_val key = Val(counterKey);
-            MDB_val val = Val(bytes.data(), bytes.size());
-            if (const int rc = mdb_put(txn, m_meta, &key, &val, 0); rc != 0) {
-                Check(rc, "commit: setting counter '" + name + "'");
-            }
+            Check(found, "commit: reading image " + OidText(oid));
+            Uncount(next, old.mv_size);
+            Check(mdb_del(txn, m_images, &key, nullptr), "commit: deleting image " + OidText(oid));
         }
         for (const auto& [name, oid] : batch.roots) {
-            const std::string rootKey = MetaKey(kRootPrefix, name);
-            const auto bytes = Le64(oid);
-            MDB_val key = Val(rootKey);
-            MDB_val value = Val(bytes.data(), bytes.size());
-            if (const int rc = mdb_put(txn, m_meta, &key, &value, 0); rc != 0) {
-                Check(rc, "commit: setting root '" + name + "'");
+            if (name.size() > kMaxNameBytes) {
+                Fail("commit: setting root '" + name + "': " + NameTooLong(name));
             }
+            next.roots.insert_or_assign(name, oid);
         }
-        const auto counter = Le64(batch.nextIdentity);
-        MDB_val key = Val(kNextIdentityKey);
-        MDB_val value = Val(counter.data(), counter.size());
-        Check(mdb_put(txn, m_meta, &key, &value, 0), "commit: writing the identity counter");
+        for (const auto& [name, value] : batch.counters) {
+            if (name.size() > kMaxNameBytes) {
+                Fail("commit: setting counter '" + name + "': " + NameTooLong(name));
+            }
+            next.counters.insert_or_assign(name, value);
+        }
+        next.nextIdentity = batch.nextIdentity;
+        WriteState(txn, next);
     });
+    *m_state = std::move(next);
 }
 
 void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
@@ -757,19 +981,10 @@ StoreStats LmdbStore::Stats() {
     Check(mdb_stat(read.Txn(), m_images, &stat), "counting the images");
     StoreStats stats;
     stats.numImages = static_cast<ssize_t>(stat.ms_entries);
-    int rc = 0;
-    Cursor cursor(read.Txn(), m_images, &rc);
-    Check(rc, "measuring the images");
-    MDB_val key;
-    MDB_val value;
-    // Only the record sizes are read; the records' pages are not touched.
-    for (rc = cursor.Get(&key, &value, MDB_FIRST); rc == MDB_SUCCESS;
-         rc = cursor.Get(&key, &value, MDB_NEXT)) {
-        stats.numImageBytes += static_cast<ssize_t>(value.mv_size);
-    }
-    if (rc != MDB_NOTFOUND) {
-        Check(rc, "measuring the images");
-    }
+    // A format-1 store read as it is kept no count of the bytes: they are
+    // counted here, from the leaves of the images' tree.
+    stats.numImageBytes = static_cast<ssize_t>(
+        m_state->imageBytesKnown ? m_state->imageBytes : SumImageBytes(read.Txn()));
     return stats;
 }
 

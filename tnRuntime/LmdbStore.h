@@ -3,17 +3,48 @@
 // The embedded on-disk store: object images, named roots, named counters and
 // the identity counter in one LMDB environment inside a directory.
 //
-// Directory contents: LMDB's "data.mdb" and "lock.mdb", nothing else. The
-// environment holds two named databases:
+// Directory contents: LMDB's "data.mdb" and "lock.mdb" (the files of callers,
+// such as a journal, may sit beside them). The environment holds two named
+// databases:
 //   "images"  key: identity, 8 bytes big-endian (so byte order is numeric
 //             order and the file reads the same on every host);
 //             value: the framed image record of tnRuntime/ImageRecord.h.
-//   "meta"    "format"        -> "TARNSTOR" + format version, 4 bytes LE (1)
-//             "next-identity" -> the identity counter, 8 bytes LE
-//             "root:<name>"   -> the identity of root <name>, 8 bytes LE
-//             "counter:<name>" -> the value of counter <name>, 8 bytes LE
-// A directory whose environment has no "meta" database with this format
-// marker is not a store and is refused.
+//   "meta"    one record under the key "state" that holds every meta value
+//             under one checksum (format version 2). All integers are
+//             little-endian:
+//               offset  size  field
+//               0       8     magic "TARNSTOR"
+//               8       4     format version, 2
+//               12      8     identity counter (the next identity to hand out)
+//               20      8     image bytes: the sum of the sizes of all image
+//                             records, as StoreStats::numImageBytes reports
+//               28      4     number of roots R
+//               32            R roots in increasing byte order of their
+//                             names, each: name length n (2), name (n bytes),
+//                             identity (8)
+//                       4     number of counters C
+//                             C counters in increasing byte order of their
+//                             names, each: name length n (2), name (n bytes),
+//                             value (8)
+//               end-8   8     XXH3-64 (seed 0) of all the bytes before it
+//             A name has at most 1024 bytes; a record without roots and
+//             counters has 44 bytes.
+// A directory whose environment has no "meta" database is not a store and
+// is refused. A "meta" database without the record (and without the marker
+// of format 1), and a record that is shorter than 44 bytes, fails its
+// checksum or does not parse, make a damaged store: every opener refuses it
+// with a RuntimeError; none takes it for a store without roots. A record of
+// another version is refused as an unsupported format.
+//
+// Format 1 kept each meta value under a key of its own, without a checksum:
+// "format" -> "TARNSTOR" + version 1 (4 bytes), "next-identity" -> the
+// identity counter, "root:<name>" -> an identity, "counter:<name>" -> a value
+// (8 bytes each), and no image bytes. A ReadOnly opener reads such a store as
+// it is and counts the image bytes when Stats asks. The first writable opener
+// upgrades it in place in one write transaction: it counts the image bytes
+// (one walk of the images' leaves), writes the record and removes the old
+// keys, so that a crash leaves one format or the other; Repairs() reports the
+// upgrade and FormatVersion() the version found.
 //
 // Decisions:
 // - Atomicity: a Commit is one LMDB write transaction (images written, images
@@ -36,6 +67,18 @@
 //   them): a second opener in the same process is refused with "in use".
 //   A child made by fork() may open the store afresh (never use a store it
 //   inherited): it then counts as another process.
+// - Meta values: every Commit writes the whole meta record anew, in the same
+//   write transaction as the images. The writer keeps the values in memory:
+//   a commit makes its new values in a copy, which replaces them once the
+//   transaction has committed, so a failed commit leaves them as they were.
+//   FindRoot, Roots, FindCounter and NextIdentity answer from memory: the
+//   writer's as of its latest commit, a ReadOnly store's as read (and
+//   verified) once from its snapshot at Open.
+// - Stats: the number of images is LMDB's count and the image bytes are the
+//   record's, so Stats costs the same for any number of images (except for a
+//   format-1 store read as it is). Commit keeps the image bytes up to date:
+//   for a record it replaces or deletes it looks up the old record's size
+//   first, in the same transaction.
 // - Snapshots: a ReadOnly store holds one LMDB read transaction from Open to
 //   its destruction. Every read of it (Load, FindRoot, Roots, FindCounter,
 //   NextIdentity, ForEachIdentity, Stats) sees the commit that was the
@@ -71,6 +114,8 @@ struct MDB_env;
 struct MDB_txn;
 
 namespace tarn {
+
+struct LmdbStoreState;
 
 enum class OpenMode {
     CreateIfMissing,  // make the directory and an empty store when there is none
@@ -122,8 +167,13 @@ public:
     uint64 DataBytes(bool withoutFreePages = false);
 
     const std::string& Directory() const { return m_dir; }
-    // What opening repaired (a lock file made anew), one line each.
+    // What opening repaired or changed (a lock file made anew, the store
+    // upgraded from format 1), one line each.
     const std::vector<std::string>& Repairs() const { return m_repairs; }
+    // The store's format version as found when it was opened: 2, or 1 for a
+    // store of the older format (which a writable opener has upgraded to 2;
+    // see Repairs()). A store made by this opener is of version 2.
+    uint32 FormatVersion() const { return m_foundVersion; }
     // The current upper bound of the data file; grows as commits need it.
     std::size_t MapSize();
 
@@ -137,12 +187,14 @@ private:
     void OpenEnvironment();
     void OpenDatabases(OpenMode mode);
     void BeginSnapshot();
-    void CheckFormat(MDB_txn* txn);
+    LmdbStoreState ReadState(MDB_txn* txn, uint32* version, std::vector<std::string>* oldKeys);
+    LmdbStoreState ReadFormat1(MDB_txn* txn, std::vector<std::string>* oldKeys);
+    void WriteState(MDB_txn* txn, const LmdbStoreState& state);
+    uint64 SumImageBytes(MDB_txn* txn);
     template <class Apply>
     void WriteTransaction(Apply&& apply);
     void GrowMap();
     MDB_txn* BeginRead();
-    uint64 ReadMeta64(MDB_txn* txn, std::string_view key, bool* found);
 
     [[noreturn]] void Fail(const std::string& what) const;
     void Check(int rc, std::string_view doing) const;
@@ -159,6 +211,10 @@ private:
     MDB_txn* m_reader = nullptr;
     unsigned int m_images = 0;  // LMDB database handles (MDB_dbi)
     unsigned int m_meta = 0;
+    uint32 m_foundVersion = 0;
+    // The meta values: a writer's as of its latest commit, a ReadOnly
+    // store's as of its snapshot.
+    std::unique_ptr<LmdbStoreState> m_state;
     std::vector<std::string> m_repairs;
     std::mutex m_mutex;
 };
