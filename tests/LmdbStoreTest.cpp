@@ -13,7 +13,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <cstdint>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -27,6 +29,7 @@
 
 #include "tests/AssertDeath.h"
 #include "tnRuntime/ImageRecord.h"
+#include "tnRuntime/LmdbFileCheck.h"
 
 namespace tarn {
 namespace {
@@ -599,6 +602,301 @@ TEST(LmdbStoreStats, ImageBytesFollowEveryChangeAndSurviveReopening) {
     store.reset();
     model.ExpectHeldBy(*OpenScratch(dir.Path(), OpenMode::ReadOnly));
     model.ExpectHeldBy(*OpenScratch(dir.Path(), OpenMode::MustExist));
+}
+
+// LMDB 0.9's data.mdb as far as the tests below take it apart: pages of the
+// size that meta page 0 names (at byte 40); each page starts with a 16-byte
+// header (page number 8, pad 2, flags 2, lower bound 2, upper bound 2), and a
+// branch or leaf page's node offsets (2 bytes each) follow it up to the lower
+// bound. A node: two 2-byte halves of a leaf's data size or of a branch's
+// child page number, flags 2 (a branch: the child's high 16 bits), key size
+// 2, the key, then a leaf's data. A meta page holds the main database's
+// record at byte 88 (its root page at byte 128) and the transaction id at
+// byte 144; the main database's leaf names each named database, its 48-byte
+// record (root page at byte 40) as the data.
+class DataFile {
+public:
+    static constexpr uint64 kBranch = 0x01;
+
+    explicit DataFile(std::string path) : m_path(std::move(path)), m_bytes(FileText(m_path)) {
+        m_pageSize = Le(40, 4);
+    }
+
+    uint64 Pages() const { return m_bytes.size() / m_pageSize; }
+    uint64 Flags(uint64 page) const { return Le(page * m_pageSize + 10, 2); }
+
+    // The byte offsets within `page` of its nodes.
+    std::vector<uint64> Nodes(uint64 page) const {
+        std::vector<uint64> nodes;
+        const uint64 lower = Le(page * m_pageSize + 12, 2);
+        for (uint64 at = 16; at + 2 <= lower; at += 2) {
+            nodes.push_back(Le(page * m_pageSize + at, 2));
+        }
+        return nodes;
+    }
+    std::string Key(uint64 page, uint64 node) const {
+        const uint64 at = page * m_pageSize + node;
+        return m_bytes.substr(at + 8, Le(at + 6, 2));
+    }
+    uint64 Child(uint64 page, uint64 node) const {
+        const uint64 at = page * m_pageSize + node;
+        return Le(at, 2) | Le(at + 2, 2) << 16 | Le(at + 4, 2) << 32;
+    }
+    void SetChild(uint64 page, uint64 node, uint64 child) {
+        const uint64 at = page * m_pageSize + node;
+        Put(at, child & 0xffff, 2);
+        Put(at + 2, (child >> 16) & 0xffff, 2);
+        Put(at + 4, child >> 32, 2);
+    }
+    void SetNodeOffset(uint64 page, std::size_t index, uint64 offset) {
+        Put(page * m_pageSize + 16 + 2 * index, offset, 2);
+    }
+    // A leaf node's first overflow page (a node with flag 0x01 holds its
+    // page number as its data), and the run's page count (at byte 12).
+    uint64 Overflow(uint64 page, uint64 node) const {
+        const uint64 at = page * m_pageSize + node;
+        return Le(at + 8 + Le(at + 6, 2), 8);
+    }
+    uint64 RunPages(uint64 page) const { return Le(page * m_pageSize + 12, 4); }
+    void SetRunPages(uint64 page, uint64 count) { Put(page * m_pageSize + 12, count, 4); }
+
+    // The root page of the named database `name`, as the newest meta page
+    // has it.
+    uint64 Root(const std::string& name) const {
+        const uint64 meta = Le(m_pageSize + 144, 8) > Le(144, 8) ? m_pageSize : 0;
+        const uint64 main = Le(meta + 128, 8);
+        for (const uint64 node : Nodes(main)) {
+            if (Key(main, node) == name) {
+                return Le(main * m_pageSize + node + 8 + name.size() + 40, 8);
+            }
+        }
+        ADD_FAILURE() << "no database " << name;
+        return 0;
+    }
+
+    // The leaves of the tree under `page`, left to right.
+    std::vector<uint64> Leaves(uint64 page) const {
+        if (Flags(page) != kBranch) {
+            return {page};
+        }
+        std::vector<uint64> leaves;
+        for (const uint64 node : Nodes(page)) {
+            for (const uint64 leaf : Leaves(Child(page, node))) {
+                leaves.push_back(leaf);
+            }
+        }
+        return leaves;
+    }
+
+    void Write() const { std::ofstream(m_path, std::ios::binary | std::ios::trunc) << m_bytes; }
+
+private:
+    uint64 Le(uint64 at, int width) const {
+        uint64 value = 0;
+        for (int i = width - 1; i >= 0; --i) {
+            value = value << 8 | static_cast<unsigned char>(m_bytes.at(at + i));
+        }
+        return value;
+    }
+    void Put(uint64 at, uint64 value, int width) {
+        for (int i = 0; i < width; ++i) {
+            m_bytes.at(at + i) = static_cast<char>(value >> (8 * i));
+        }
+    }
+
+    std::string m_path;
+    std::string m_bytes;
+    uint64 m_pageSize = 0;
+};
+
+uint64 IdentityOfKeyText(const std::string& key) {
+    uint64 oid = 0;
+    for (const char c : key) {
+        oid = oid << 8 | static_cast<unsigned char>(c);
+    }
+    return oid;
+}
+
+// A store of 3000 small images written in one commit, so that the images'
+// tree has branch pages; the identity counter is 5000.
+void MakeBranchyStore(const std::string& dir) {
+    CommitBatch batch;
+    for (uint64 oid = 1; oid <= 3000; ++oid) {
+        batch.writes.emplace_back(oid, MakeImage(7, oid, 40));
+    }
+    batch.roots["head"] = 1;
+    batch.nextIdentity = 5000;
+    OpenScratch(dir, OpenMode::CreateIfMissing)->Commit(batch);
+}
+
+// A child page number past the end of the file: LMDB itself bounds page
+// numbers by the commit's last page, and the store turns its answer into a
+// damaged store for this call and every later one. Opening reads no branch
+// page and so opens; the whole-store walk finds the damage.
+TEST(LmdbStorePageFaults, AChildPagePastTheEndOfTheFileIsAnError) {
+    TempDir dir;
+    MakeBranchyStore(dir.Path());
+    DataFile file(dir.Sub("data.mdb"));
+    const uint64 root = file.Root("images");
+    ASSERT_EQ(file.Flags(root), DataFile::kBranch);
+    const std::vector<uint64> nodes = file.Nodes(root);
+    ASSERT_GT(nodes.size(), 6u);
+    const uint64 cut = IdentityOfKeyText(file.Key(root, nodes[5]));  // the first under child 5
+    file.SetChild(root, nodes[5], file.Pages() + 1000);
+    file.Write();
+    EXPECT_ERROR_MENTIONS(CheckLmdbPages(dir.Path()),
+                          "data.mdb is damaged: page " + std::to_string(root));
+    const std::string damaged = "damaged store: reading image #" + std::to_string(cut);
+    for (const OpenMode mode : {OpenMode::ReadOnly, OpenMode::MustExist}) {
+        auto store = OpenScratch(dir.Path(), mode);
+        EXPECT_EQ(store->Load(1)->bytes, MakeImage(7, 1, 40).bytes);
+        EXPECT_ERROR_MENTIONS(store->Load(cut), damaged);
+        EXPECT_ERROR_MENTIONS(store->Load(1), damaged);
+        EXPECT_ERROR_MENTIONS(store->FindRoot("head"), damaged);
+    }
+    {
+        auto writer = OpenScratch(dir.Path(), OpenMode::MustExist);
+        CommitBatch batch;
+        batch.writes.emplace_back(cut, MakeImage(8, cut, 10));
+        batch.nextIdentity = 6000;
+        EXPECT_ERROR_MENTIONS(writer->Commit(batch), "damaged store: commit: writing image #");
+        EXPECT_ERROR_MENTIONS(writer->Commit(CommitBatch{}), "damaged store: commit: writing");
+    }
+    EXPECT_EQ(OpenScratch(dir.Path(), OpenMode::ReadOnly)->NextIdentity(), 5000u);
+}
+
+// A leaf whose node offsets point past the end of the file makes LMDB read
+// past it: a SIGBUS inside the map, which the page guard turns into a
+// damaged store, for this call and every later one. The process goes on;
+// the writer commits nothing, and a later opener reads the rest.
+TEST(LmdbStorePageFaults, AReadPastTheEndOfTheFileIsConfinedToAnError) {
+    TempDir dir;
+    MakeBranchyStore(dir.Path());
+    DataFile file(dir.Sub("data.mdb"));
+    std::vector<uint64> leaves = file.Leaves(file.Root("images"));
+    ASSERT_GT(leaves.size(), 10u);
+    const uint64 leaf = *std::max_element(leaves.begin(), leaves.end());
+    // Offsets reach at most 64 KiB past the start of their page.
+    ASSERT_GT((leaf * 4096 + 0xfff8) / 4096, file.Pages()) << "the last leaf lies too early";
+    const std::vector<uint64> nodes = file.Nodes(leaf);
+    const uint64 inLeaf = IdentityOfKeyText(file.Key(leaf, nodes[nodes.size() / 2]));
+    for (std::size_t i = 0; i < nodes.size(); ++i) {
+        file.SetNodeOffset(leaf, i, 0xfff8);
+    }
+    file.Write();
+    const std::string fault = "damaged store: a page of data.mdb could not be read while ";
+    {
+        auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+        EXPECT_EQ(reader->Load(1)->bytes, MakeImage(7, 1, 40).bytes);
+        std::string first;
+        try {
+            reader->Load(inLeaf);
+            ADD_FAILURE() << "no error";
+        } catch (const RuntimeError& e) {
+            first = e.what();
+        }
+        EXPECT_NE(first.find(fault + "reading an image (SIGBUS at byte "), std::string::npos)
+            << first;
+        for (const auto& call : std::vector<std::function<void()>>{
+                 [&] { reader->Load(1); }, [&] { reader->Stats(); }, [&] { reader->Roots(); },
+                 [&] { reader->ForEachIdentity([](uint64) {}); }}) {
+            EXPECT_ERROR_MENTIONS(call(), first);
+        }
+    }
+    EXPECT_ERROR_MENTIONS(
+        OpenScratch(dir.Path(), OpenMode::ReadOnly)->ForEachIdentity([](uint64) {}),
+        fault + "listing the images (SIGBUS");
+    {
+        auto writer = OpenScratch(dir.Path(), OpenMode::MustExist);
+        CommitBatch batch;
+        batch.writes.emplace_back(inLeaf, MakeImage(8, inLeaf, 10));
+        batch.nextIdentity = 6000;
+        EXPECT_ERROR_MENTIONS(writer->Commit(batch), fault + "committing (SIGBUS");
+        EXPECT_ERROR_MENTIONS(writer->Commit(CommitBatch{}), fault + "committing (SIGBUS");
+        EXPECT_ERROR_MENTIONS(writer->NextIdentity(), fault + "committing (SIGBUS");
+    }
+    auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+    EXPECT_EQ(reader->NextIdentity(), 5000u);
+    EXPECT_EQ(reader->Load(1)->bytes, MakeImage(7, 1, 40).bytes);
+}
+
+// LMDB frees as many pages as the first header of an image's overflow run
+// says when the image is replaced or deleted: a writer refuses to do so with
+// a damaged count (which would hand pages in use to later writes, or append
+// billions of page numbers to the free list). Readers do not use the count.
+TEST(LmdbStorePageFaults, AWriterFreesNoOverflowRunWithADamagedCount) {
+    TempDir dir;
+    const std::string original = dir.Sub("original");
+    {
+        CommitBatch batch;
+        for (uint64 oid = 1; oid <= 4; ++oid) {
+            batch.writes.emplace_back(oid, MakeImage(7, oid, oid == 4 ? 20000 : 40));
+        }
+        OpenScratch(original, OpenMode::CreateIfMissing)->Commit(batch);
+    }
+    const uint64 run = [&] {
+        DataFile file(original + "/data.mdb");
+        const uint64 leaf = file.Root("images");
+        return file.Overflow(leaf, file.Nodes(leaf).at(3));
+    }();
+    const uint64 pages = DataFile(original + "/data.mdb").RunPages(run);
+    ASSERT_EQ(pages, 5u);  // the 20 KiB record on 4 KiB pages
+    const std::string copy = dir.Sub("copy");
+    for (const uint64 count : {pages - 1, pages | 0x57000000}) {
+        SCOPED_TRACE(count);
+        for (const bool replace : {true, false}) {
+            CopyStore(original, copy);
+            DataFile file(copy + "/data.mdb");
+            file.SetRunPages(run, count);
+            file.Write();
+            CommitBatch batch;
+            if (replace) {
+                batch.writes.emplace_back(4, MakeImage(8, 4, 10));
+            } else {
+                batch.deletes.push_back(4);
+            }
+            batch.nextIdentity = 9;
+            EXPECT_ERROR_MENTIONS(OpenScratch(copy, OpenMode::MustExist)->Commit(batch),
+                                  std::string("damaged store: commit: ") +
+                                      (replace ? "writing" : "deleting") +
+                                      " image #4: the header of its overflow pages is damaged");
+            auto reader = OpenScratch(copy, OpenMode::ReadOnly);
+            EXPECT_EQ(reader->NextIdentity(), 1u);
+            EXPECT_EQ(reader->Load(4)->bytes, MakeImage(7, 4, 20000).bytes);
+        }
+        EXPECT_ERROR_MENTIONS(CheckLmdbPages(copy), "has a damaged header");
+    }
+}
+
+// The page guards' handler passes a fault outside every map on: the process
+// ends as it would without a store (by the signal, or through the
+// sanitizer's report in a sanitized build), neither carrying on nor
+// faulting forever.
+TEST(LmdbStorePageFaults, AFaultOutsideTheMapEndsTheProcessAsBefore) {
+    TempDir dir;
+    MakeBranchyStore(dir.Path());
+    const pid_t pid = ::fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+        ::alarm(20);  // a fault repeated forever ends by SIGALRM
+        try {
+            auto store = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+            if (store->Load(1)->bytes != MakeImage(7, 1, 40).bytes) {
+                ::_exit(2);
+            }
+            static_cast<void>(*reinterpret_cast<volatile const int*>(std::uintptr_t{64}));
+        } catch (const RuntimeError&) {
+            ::_exit(3);
+        }
+        ::_exit(0);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(pid, &status, 0), pid);
+#if defined(__SANITIZE_ADDRESS__)
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 1) << "status " << status;
+#else
+    EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGSEGV) << "status " << status;
+#endif
 }
 
 // The writer of the crash test: commits MakeCommit(k), k = 1, 2, ... after

@@ -4,14 +4,21 @@
 #ifdef TARN_HAVE_LMDB
 
 #include <fcntl.h>
+#include <setjmp.h>
+#include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cstdint>
+#include <cstdio>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <limits>
 #include <set>
 #include <span>
@@ -58,6 +65,134 @@ constexpr std::string_view kCounterPrefix = "counter:";
 // ForEachIdentity reads identities in chunks of this many, so that the
 // callback runs with no transaction open and may use the store itself.
 constexpr std::size_t kIdentityChunk = 1024;
+
+// What LMDB checks of its own pages, and what this store adds.
+//
+// Debian's LMDB (0.9.24, as tried with damaged files) bounds every page
+// number it follows by the transaction's next page number: a child or
+// overflow page number at or past the end of the pages of the commit read
+// gives MDB_PAGE_NOTFOUND, and Open has checked that data.mdb reaches to the
+// end of those pages. A descent that ends on a page that is not a leaf (a
+// meta page, say) gives MDB_CORRUPTED, and a cycle of branch pages fills the
+// cursor's stack: MDB_CURSOR_FULL. These arrive as a RuntimeError naming the
+// damage (see Check). What LMDB does not check is the inside of a page: node
+// offsets, key sizes and data sizes are trusted, so a damaged page can make
+// LMDB (or the caller reading a value) read past the page, past the end of
+// the file (SIGBUS, since the map is larger than the file) or past the map
+// (SIGSEGV); so can a data.mdb cut short while it is open.
+//
+// The store runs every LMDB call that reads pages, and its own reads of the
+// keys and values LMDB returns, under a PageGuard: a SIGSEGV or SIGBUS of the
+// thread inside a guard whose faulting address lies inside this
+// environment's map jumps back to the guard (sigsetjmp/siglongjmp, from a
+// process-wide handler chained to the handler installed before it) and
+// becomes a RuntimeError; the store is then poisoned (see PageFault). Any
+// other fault goes on to the previous handler, or to the default action,
+// unchanged. Between the guard's sigsetjmp and the call's end there are only
+// LMDB's C frames and objects without destructors, so the jump skips no
+// destructor; what LMDB was doing is abandoned, which is why the store is
+// poisoned.
+//
+// Limits: a read that runs past the end of the map (a page at the very end
+// of a full map) is not confined. A page that is sound in itself but wrong
+// (a child page number naming another leaf) gives a wrong answer without a
+// fault: most often "no such image"; a record found instead of another fails
+// its checksum, which binds it to its identity, and the meta record has a
+// checksum of its own. CheckLmdbPages (tnRuntime/LmdbFileCheck.h) walks every
+// page for a whole-store validation. A program that installs its own SIGSEGV
+// or SIGBUS handler after the first store was opened takes the faults from
+// the guard (then they end as they would without it).
+//
+// AddressSanitizer installs its handlers for both signals at start-up. Under
+// its default options (handle_segv=1, allow_user_segv_handler=1; as tried
+// with GCC 12's) the handler here replaces them and passes every other fault
+// on to them, so a sanitized program still reports its wild accesses; no
+// option is needed. (handle_segv=2 would keep any handler but the
+// sanitizer's from being installed: the guards would then confine nothing.)
+struct PageGuard {
+    sigjmp_buf jump;
+    std::uintptr_t mapBegin = 0;
+    std::uintptr_t mapEnd = 0;
+    PageGuard* outer = nullptr;  // a guard this one runs inside of
+    volatile std::uintptr_t faultAddress = 0;
+    volatile int faultSignal = 0;
+};
+
+// The innermost active guard of the thread.
+constinit thread_local PageGuard* t_pageGuard = nullptr;
+
+// The handlers installed before this store's, by signal.
+struct sigaction g_previousSegv;
+struct sigaction g_previousBus;
+
+// Hands a fault outside every guard to the handler installed before, or
+// ends the process as the default action does. Async-signal-safe.
+void PassFaultOn(int signal, siginfo_t* info, void* context) {
+    const struct sigaction& previous = signal == SIGBUS ? g_previousBus : g_previousSegv;
+    if ((previous.sa_flags & SA_SIGINFO) != 0) {
+        previous.sa_sigaction(signal, info, context);
+        return;
+    }
+    if (previous.sa_handler == SIG_IGN && info->si_code <= 0) {
+        return;  // sent by a process, and ignored as before
+    }
+    if (previous.sa_handler == SIG_DFL || previous.sa_handler == SIG_IGN) {
+        // (a fault cannot be ignored: the kernel ends the process for it)
+        struct sigaction fallback = {};
+        fallback.sa_handler = SIG_DFL;
+        sigemptyset(&fallback.sa_mask);
+        ::sigaction(signal, &fallback, nullptr);
+        ::raise(signal);
+        return;
+    }
+    previous.sa_handler(signal);
+}
+
+void OnFault(int signal, siginfo_t* info, void* context) {
+    PageGuard* guard = t_pageGuard;
+    const auto address = reinterpret_cast<std::uintptr_t>(info->si_addr);
+    if (guard != nullptr && address >= guard->mapBegin && address < guard->mapEnd) {
+        guard->faultAddress = address;
+        guard->faultSignal = signal;
+        siglongjmp(guard->jump, 1);
+    }
+    PassFaultOn(signal, info, context);
+}
+
+// Installs OnFault for SIGSEGV and SIGBUS, once per process. SA_NODEFER
+// leaves the signal unblocked in the handler, so that the jump out of it
+// (which does not restore the signal mask: saving it would cost a system call
+// per guard) leaves the mask as it was.
+void InstallFaultHandler() {
+    static std::once_flag once;
+    std::call_once(once, [] {
+        struct sigaction action = {};
+        action.sa_sigaction = OnFault;
+        action.sa_flags = SA_SIGINFO | SA_ONSTACK | SA_NODEFER;
+        sigemptyset(&action.sa_mask);
+        ::sigaction(SIGSEGV, &action, &g_previousSegv);
+        ::sigaction(SIGBUS, &action, &g_previousBus);
+    });
+}
+
+// Returned for a key or value that LMDB places partly past the end of the
+// map: a damaged data size (LMDB's own codes are negative, errno values
+// positive).
+constexpr int kPastTheMap = -1;
+
+// Returned for an image whose run of overflow pages has a damaged header.
+constexpr int kDamagedRun = -2;
+
+// LMDB 0.9's page header: page number 8, pad 2, flags 2, then (an overflow
+// page) the number of pages in the run, 4.
+constexpr std::size_t kPageHeaderBytes = 16;
+constexpr std::size_t kPageFlagsOffset = 10;
+constexpr std::size_t kRunPagesOffset = 12;
+constexpr uint64 kOverflowPage = 0x04;
+constexpr uint64 kDirtyPage = 0x10;
+
+// A key or value is read one byte in this many while the guard is up.
+constexpr std::size_t kTouchStride = 4096;
 
 // Raised inside a write transaction when the map is full; the transaction is
 // aborted, the map grown and the transaction run again.
@@ -220,26 +355,6 @@ void PrepareDirectory(const std::string& dir, OpenMode mode) {
     }
 }
 
-// An open cursor, closed when the scope ends.
-class Cursor {
-public:
-    Cursor(MDB_txn* txn, MDB_dbi dbi, int* rc) { *rc = mdb_cursor_open(txn, dbi, &m_cursor); }
-    ~Cursor() {
-        if (m_cursor != nullptr) {
-            mdb_cursor_close(m_cursor);
-        }
-    }
-    Cursor(const Cursor&) = delete;
-    Cursor& operator=(const Cursor&) = delete;
-
-    int Get(MDB_val* key, MDB_val* data, MDB_cursor_op op) {
-        return mdb_cursor_get(m_cursor, key, data, op);
-    }
-
-private:
-    MDB_cursor* m_cursor = nullptr;
-};
-
 }  // namespace
 
 // The meta values of one commit: what the meta record holds.
@@ -343,6 +458,158 @@ private:
     bool m_keep;
 };
 
+// Runs `call` (LMDB calls and reads of what they return, nothing that
+// throws or owns a resource) under a page guard; returns what it returns.
+template <class Call>
+int LmdbStore::Guarded(const char* doing, Call&& call) {
+    static_assert(std::is_nothrow_invocable_r_v<int, Call>, "a guarded call may not throw");
+    PageGuard guard;
+    guard.mapBegin = m_mapBegin;
+    guard.mapEnd = m_mapEnd;
+    guard.outer = t_pageGuard;
+    if (sigsetjmp(guard.jump, 0) != 0) {
+        t_pageGuard = guard.outer;
+        PageFault(doing, guard.faultSignal, guard.faultAddress);
+    }
+    t_pageGuard = &guard;
+    const int rc = call();
+    t_pageGuard = guard.outer;
+    return rc;
+}
+
+// Guarded, and a failure of `call` thrown as Check throws it.
+template <class Call>
+void LmdbStore::CheckGuarded(const char* doing, Call&& call) {
+    Check(Guarded(doing, std::forward<Call>(call)), doing);
+}
+
+// Reads a byte of every page of a key or value LMDB returned, so that a part
+// of it past the end of the file faults under the guard, before the caller
+// reads it. A key or value that starts outside the map lies in a page the
+// write transaction has changed (LMDB keeps those in memory) and is read as
+// it is; one that starts inside the map and ends past it is damage.
+int LmdbStore::Touch(const MDB_val& val) const noexcept {
+    if (val.mv_size == 0) {
+        return MDB_SUCCESS;
+    }
+    const auto begin = reinterpret_cast<std::uintptr_t>(val.mv_data);
+    if (begin < m_mapBegin || begin >= m_mapEnd) {
+        return MDB_SUCCESS;
+    }
+    if (val.mv_size > m_mapEnd - begin) {
+        return kPastTheMap;
+    }
+    const auto* bytes = static_cast<const volatile octet_t*>(val.mv_data);
+    for (std::size_t at = 0; at < val.mv_size; at += kTouchStride) {
+        static_cast<void>(bytes[at]);
+    }
+    static_cast<void>(bytes[val.mv_size - 1]);
+    return MDB_SUCCESS;
+}
+
+// Checks the header of the run of overflow pages that holds `old`, a record
+// that the write transaction is about to replace or delete, against the
+// commit's `pages`. LMDB frees as many pages as that header says without
+// looking further: a damaged count would hand pages still in use to later
+// writes (or, reaching past the file, append billions of page numbers to its
+// free list). A record on a page of the map's that is not the first of an
+// overflow run (pointer minus the header not on a page boundary) lies in its
+// leaf, and one outside the map in a page this transaction wrote: neither
+// has a run to check. Only the records a commit replaces or deletes are
+// checked here; CheckLmdbPages checks every run.
+int LmdbStore::CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept {
+    const auto at = reinterpret_cast<std::uintptr_t>(old.mv_data);
+    if (at < m_mapBegin + kPageHeaderBytes || at >= m_mapEnd ||
+        (at - kPageHeaderBytes - m_mapBegin) % m_pageSize != 0) {
+        return MDB_SUCCESS;
+    }
+    const auto* header = reinterpret_cast<const octet_t*>(at - kPageHeaderBytes);
+    const uint64 page = (at - kPageHeaderBytes - m_mapBegin) / m_pageSize;
+    const uint64 run = GetLe(header + kRunPagesOffset, 4);
+    const uint64 needed = (kPageHeaderBytes - 1 + old.mv_size) / m_pageSize + 1;
+    if (GetLe(header, 8) != page ||
+        (GetLe(header + kPageFlagsOffset, 2) & ~kDirtyPage) != kOverflowPage || run < needed ||
+        run > pages - std::min(page, pages)) {
+        return kDamagedRun;
+    }
+    return MDB_SUCCESS;
+}
+
+// After a fault under a guard: LMDB's state inside the environment cannot be
+// trusted any more, so the store is poisoned: this call and every later one
+// throw the same error. What can be aborted is aborted as the error unwinds
+// (a write transaction, a read scope); nothing is committed.
+void LmdbStore::PageFault(const char* doing, int signal, std::uintptr_t address) {
+    const std::uintptr_t offset = address - m_mapBegin;
+    std::string fileBytes = "an unknown number of";
+    int fd = -1;
+    struct stat st;
+    if (mdb_env_get_fd(m_env, &fd) == MDB_SUCCESS && ::fstat(fd, &st) == 0) {
+        fileBytes = std::to_string(st.st_size);
+    }
+    m_poisoned = "LMDB store '" + m_dir +
+                 "': damaged store: a page of data.mdb could not be read while " + doing + " (" +
+                 (signal == SIGBUS ? "SIGBUS" : "SIGSEGV") + " at byte " + std::to_string(offset) +
+                 " of the map, in page " +
+                 std::to_string(offset / std::max<std::size_t>(m_pageSize, 1)) + "; data.mdb has " +
+                 fileBytes + " bytes)";
+    throw RuntimeError(m_poisoned);
+}
+
+void LmdbStore::ThrowIfPoisoned() const {
+    if (!m_poisoned.empty()) {
+        throw RuntimeError(m_poisoned);
+    }
+}
+
+// An open cursor, closed when the scope ends; its reads run under the guard,
+// and so do the caller's reads of the keys (and values) it returns.
+class LmdbStore::Cursor {
+public:
+    enum class Touching : uint8 { Nothing, Key, KeyAndValue };
+
+    Cursor(LmdbStore& store, MDB_txn* txn, MDB_dbi dbi, const char* doing)
+        : m_store(store), m_doing(doing) {
+        store.Check(
+            store.Guarded(doing, [&]() noexcept { return mdb_cursor_open(txn, dbi, &m_cursor); }),
+            doing);
+    }
+    ~Cursor() {
+        if (m_cursor != nullptr) {
+            mdb_cursor_close(m_cursor);
+        }
+    }
+    Cursor(const Cursor&) = delete;
+    Cursor& operator=(const Cursor&) = delete;
+
+    int Get(MDB_val* key, MDB_val* value, MDB_cursor_op op, Touching touching) {
+        return m_store.Guarded(m_doing, [&]() noexcept {
+            int rc = mdb_cursor_get(m_cursor, key, value, op);
+            if (rc == MDB_SUCCESS && touching != Touching::Nothing) {
+                rc = m_store.Touch(*key);
+            }
+            if (rc == MDB_SUCCESS && touching == Touching::KeyAndValue) {
+                rc = m_store.Touch(*value);
+            }
+            return rc;
+        });
+    }
+
+private:
+    LmdbStore& m_store;
+    const char* m_doing;
+    MDB_cursor* m_cursor = nullptr;
+};
+
+// mdb_get under the guard, the value touched.
+int LmdbStore::Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value,
+                   const char* doing) {
+    return Guarded(doing, [&]() noexcept {
+        const int rc = mdb_get(txn, dbi, key, value);
+        return rc == MDB_SUCCESS ? Touch(*value) : rc;
+    });
+}
+
 std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir, OpenMode mode) {
     LmdbStoreOptions options;
     options.mode = mode;
@@ -429,6 +696,7 @@ void LmdbStore::LockDirectory() {
 }
 
 void LmdbStore::OpenEnvironment() {
+    InstallFaultHandler();
     Check(mdb_env_create(&m_env), "creating the environment");
     Check(mdb_env_set_maxdbs(m_env, 2), "configuring the environment");
     Check(mdb_env_set_mapsize(m_env, m_options.initialMapSize), "setting the map size");
@@ -447,9 +715,50 @@ void LmdbStore::OpenEnvironment() {
         Fail("not readable: data.mdb was written by an incompatible LMDB version");
     }
     Check(rc, "opening the environment");
+    FindMap();
+    MDB_stat stat;
+    CheckGuarded("reading the page size", [&]() noexcept { return mdb_env_stat(m_env, &stat); });
+    m_pageSize = stat.ms_psize;
     // Readers left behind by a process that died holding them.
     int dead = 0;
     Check(mdb_reader_check(m_env, &dead), "clearing stale readers");
+}
+
+// Finds where LMDB has mapped data.mdb, for the page guards: the mapping of
+// this file in /proc/self/maps. Where that cannot be read, no address is
+// taken for this map's and the guards confine no fault.
+void LmdbStore::FindMap() {
+    m_mapBegin = 0;
+    m_mapEnd = 0;
+    int fd = -1;
+    struct stat st;
+    if (mdb_env_get_fd(m_env, &fd) != MDB_SUCCESS || ::fstat(fd, &st) != 0) {
+        return;
+    }
+    std::ifstream maps("/proc/self/maps");
+    for (std::string line; std::getline(maps, line);) {
+        unsigned long long begin = 0;
+        unsigned long long end = 0;
+        unsigned long long offset = 0;
+        unsigned long long inode = 0;
+        unsigned int major = 0;
+        unsigned int minor = 0;
+        char perms[8];
+        if (std::sscanf(line.c_str(), "%llx-%llx %7s %llx %x:%x %llu", &begin, &end, perms, &offset,
+                        &major, &minor, &inode) != 7 ||
+            inode != st.st_ino || major != major(st.st_dev) || minor != minor(st.st_dev)) {
+            continue;
+        }
+        m_mapBegin = m_mapBegin == 0 ? begin : std::min<std::uintptr_t>(m_mapBegin, begin);
+        m_mapEnd = std::max<std::uintptr_t>(m_mapEnd, end);
+    }
+}
+
+// Sets the map's size (0: the size the file's meta page names); LMDB maps
+// the file anew.
+void LmdbStore::SetMapSize(std::size_t size, const char* doing) {
+    CheckGuarded(doing, [&]() noexcept { return mdb_env_set_mapsize(m_env, size); });
+    FindMap();
 }
 
 // Opens the two databases. A ReadOnly store reads its meta record from its
@@ -458,14 +767,19 @@ void LmdbStore::OpenEnvironment() {
 void LmdbStore::OpenDatabases(OpenMode mode) {
     if (m_readOnly) {
         MDB_txn* txn = nullptr;
-        Check(mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &txn), "beginning a read transaction");
+        CheckGuarded("beginning a read transaction",
+                     [&]() noexcept { return mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &txn); });
         try {
-            const int rc = mdb_dbi_open(txn, kMetaDb, 0, &m_meta);
+            const int rc = Guarded("opening the meta database", [&]() noexcept {
+                return mdb_dbi_open(txn, kMetaDb, 0, &m_meta);
+            });
             if (rc == MDB_NOTFOUND) {
                 Fail("not a store: the environment has no \"meta\" database");
             }
             Check(rc, "opening the meta database");
-            const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
+            const int rcImages = Guarded("opening the images database", [&]() noexcept {
+                return mdb_dbi_open(txn, kImagesDb, 0, &m_images);
+            });
             if (rcImages == MDB_NOTFOUND) {
                 Fail("damaged store: the \"images\" database is missing");
             }
@@ -475,7 +789,7 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             throw;
         }
         // Committing (not aborting) keeps the database handles for the store.
-        Check(mdb_txn_commit(txn), "opening the databases");
+        CheckGuarded("opening the databases", [&]() noexcept { return mdb_txn_commit(txn); });
         return;
     }
     LmdbStoreState state;
@@ -483,7 +797,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
     bool upgraded = false;
     WriteTransaction([&](MDB_txn* txn) {
         upgraded = false;
-        const int rc = mdb_dbi_open(txn, kMetaDb, 0, &m_meta);
+        const int rc = Guarded("opening the meta database",
+                               [&]() noexcept { return mdb_dbi_open(txn, kMetaDb, 0, &m_meta); });
         if (rc == MDB_NOTFOUND) {
             if (mode != OpenMode::CreateIfMissing) {
                 Fail("not a store: the environment has no \"meta\" database");
@@ -492,21 +807,27 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             // somebody else's.
             MDB_dbi main = 0;
             MDB_stat stat;
-            Check(mdb_dbi_open(txn, nullptr, 0, &main), "opening the main database");
-            Check(mdb_stat(txn, main, &stat), "examining the environment");
+            CheckGuarded("examining the environment", [&]() noexcept {
+                const int opened = mdb_dbi_open(txn, nullptr, 0, &main);
+                return opened != MDB_SUCCESS ? opened : mdb_stat(txn, main, &stat);
+            });
             if (stat.ms_entries != 0) {
                 Fail("not a store: an LMDB environment with other contents");
             }
-            Check(mdb_dbi_open(txn, kMetaDb, MDB_CREATE, &m_meta), "creating the meta database");
-            Check(mdb_dbi_open(txn, kImagesDb, MDB_CREATE, &m_images),
-                  "creating the images database");
+            CheckGuarded("creating the databases", [&]() noexcept {
+                const int meta = mdb_dbi_open(txn, kMetaDb, MDB_CREATE, &m_meta);
+                return meta != MDB_SUCCESS ? meta
+                                           : mdb_dbi_open(txn, kImagesDb, MDB_CREATE, &m_images);
+            });
             state = LmdbStoreState{};
             found = kFormatVersion;
             WriteState(txn, state);
             return;
         }
         Check(rc, "opening the meta database");
-        const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
+        const int rcImages = Guarded("opening the images database", [&]() noexcept {
+            return mdb_dbi_open(txn, kImagesDb, 0, &m_images);
+        });
         if (rcImages == MDB_NOTFOUND) {
             Fail("damaged store: the \"images\" database is missing");
         }
@@ -520,7 +841,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             state.imageBytesKnown = true;
             for (const std::string& old : oldKeys) {
                 MDB_val key = Val(old);
-                Check(mdb_del(txn, m_meta, &key, nullptr), "upgrading: removing '" + old + "'");
+                CheckGuarded("upgrading the store",
+                             [&]() noexcept { return mdb_del(txn, m_meta, &key, nullptr); });
             }
             WriteState(txn, state);
             upgraded = true;
@@ -542,7 +864,7 @@ LmdbStoreState LmdbStore::ReadState(MDB_txn* txn, uint32* version,
                                     std::vector<std::string>* oldKeys) {
     MDB_val key = Val(kStateKey);
     MDB_val value;
-    int rc = mdb_get(txn, m_meta, &key, &value);
+    int rc = Get(txn, m_meta, &key, &value, "reading the meta record");
     if (rc == MDB_SUCCESS) {
         *version = kFormatVersion;
         return DecodeState(m_dir, Bytes(value));
@@ -552,7 +874,7 @@ LmdbStoreState LmdbStore::ReadState(MDB_txn* txn, uint32* version,
     }
     // No meta record: a store of format 1, or one that lost its record.
     key = Val(kFormatKey);
-    rc = mdb_get(txn, m_meta, &key, &value);
+    rc = Get(txn, m_meta, &key, &value, "reading the format marker");
     if (rc == MDB_NOTFOUND) {
         Fail(
             "damaged store: the meta record \"state\" is missing (and there is no format-1 "
@@ -577,13 +899,13 @@ LmdbStoreState LmdbStore::ReadFormat1(MDB_txn* txn, std::vector<std::string>* ol
     LmdbStoreState state;
     state.imageBytesKnown = false;
     bool haveNext = false;
-    int rc = 0;
-    Cursor cursor(txn, m_meta, &rc);
-    Check(rc, "reading the meta values");
+    Cursor cursor(*this, txn, m_meta, "reading the meta values");
     MDB_val key;
     MDB_val value;
-    for (rc = cursor.Get(&key, &value, MDB_FIRST); rc == MDB_SUCCESS;
-         rc = cursor.Get(&key, &value, MDB_NEXT)) {
+    const auto touching = Cursor::Touching::KeyAndValue;
+    int rc = 0;
+    for (rc = cursor.Get(&key, &value, MDB_FIRST, touching); rc == MDB_SUCCESS;
+         rc = cursor.Get(&key, &value, MDB_NEXT, touching)) {
         const std::string_view name = Text(key);
         const bool root = name.starts_with(kRootPrefix);
         const bool counter = name.starts_with(kCounterPrefix);
@@ -624,20 +946,21 @@ void LmdbStore::WriteState(MDB_txn* txn, const LmdbStoreState& state) {
     const std::string record = EncodeState(state);
     MDB_val key = Val(kStateKey);
     MDB_val value = Val(record);
-    Check(mdb_put(txn, m_meta, &key, &value, 0), "writing the meta record");
+    CheckGuarded("writing the meta record",
+                 [&]() noexcept { return mdb_put(txn, m_meta, &key, &value, 0); });
 }
 
 // The sum of the sizes of all image records, from a walk of the images'
 // leaves (the records themselves are not read).
 uint64 LmdbStore::SumImageBytes(MDB_txn* txn) {
-    int rc = 0;
-    Cursor cursor(txn, m_images, &rc);
-    Check(rc, "measuring the images");
+    Cursor cursor(*this, txn, m_images, "measuring the images");
     MDB_val key;
     MDB_val value;
     uint64 bytes = 0;
-    for (rc = cursor.Get(&key, &value, MDB_FIRST); rc == MDB_SUCCESS;
-         rc = cursor.Get(&key, &value, MDB_NEXT)) {
+    const auto touching = Cursor::Touching::Nothing;
+    int rc = 0;
+    for (rc = cursor.Get(&key, &value, MDB_FIRST, touching); rc == MDB_SUCCESS;
+         rc = cursor.Get(&key, &value, MDB_NEXT, touching)) {
         bytes += value.mv_size;
     }
     if (rc != MDB_NOTFOUND) {
@@ -648,14 +971,16 @@ uint64 LmdbStore::SumImageBytes(MDB_txn* txn) {
 
 // Runs `apply` in a write transaction and commits it; when the map fills
 // up, anywhere in between, the transaction is dropped, the map doubled and
-// the whole transaction run again.
+// the whole transaction run again. A transaction that fails in any way is
+// aborted, never committed.
 template <class Apply>
 void LmdbStore::WriteTransaction(Apply&& apply) {
     for (;;) {
         MDB_txn* txn = nullptr;
-        int rc = mdb_txn_begin(m_env, nullptr, 0, &txn);
+        int rc = Guarded("beginning a write transaction",
+                         [&]() noexcept { return mdb_txn_begin(m_env, nullptr, 0, &txn); });
         if (rc == MDB_MAP_RESIZED) {
-            Check(mdb_env_set_mapsize(m_env, 0), "adopting the grown map size");
+            SetMapSize(0, "adopting the grown map size");
             continue;
         }
         Check(rc, "beginning a write transaction");
@@ -669,7 +994,14 @@ void LmdbStore::WriteTransaction(Apply&& apply) {
             mdb_txn_abort(txn);
             throw;
         }
-        rc = mdb_txn_commit(txn);  // frees the transaction, committed or not
+        try {
+            // Frees the transaction, committed or not, unless a fault
+            // stops it half-way.
+            rc = Guarded("committing", [&]() noexcept { return mdb_txn_commit(txn); });
+        } catch (...) {
+            mdb_txn_abort(txn);
+            throw;
+        }
         if (rc == MDB_MAP_FULL) {
             GrowMap();
             continue;
@@ -681,13 +1013,12 @@ void LmdbStore::WriteTransaction(Apply&& apply) {
 
 void LmdbStore::GrowMap() {
     MDB_envinfo info;
-    Check(mdb_env_info(m_env, &info), "reading the map size");
+    CheckGuarded("reading the map size", [&]() noexcept { return mdb_env_info(m_env, &info); });
     const std::size_t current = info.me_mapsize;
     if (current > std::numeric_limits<std::size_t>::max() / 2) {
         Fail("the map cannot grow beyond " + std::to_string(current) + " bytes");
     }
-    Check(mdb_env_set_mapsize(m_env, current * 2),
-          "growing the map to " + std::to_string(current * 2) + " bytes");
+    SetMapSize(current * 2, "growing the map");
 }
 
 // A reader's snapshot. The writer may have grown the map since this
@@ -696,8 +1027,10 @@ void LmdbStore::GrowMap() {
 // grow it in between.
 void LmdbStore::BeginSnapshot() {
     for (int attempt = 0;; ++attempt) {
-        Check(mdb_env_set_mapsize(m_env, 0), "adopting the map size");
-        const int rc = mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &m_reader);
+        SetMapSize(0, "adopting the map size");
+        const int rc = Guarded("beginning the read snapshot", [&]() noexcept {
+            return mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &m_reader);
+        });
         if (rc == MDB_SUCCESS) {
             return;
         }
@@ -714,19 +1047,22 @@ MDB_txn* LmdbStore::BeginRead() {
     }
     for (int attempt = 0;; ++attempt) {
         if (m_reader != nullptr) {
-            if (mdb_txn_renew(m_reader) == MDB_SUCCESS) {
+            if (Guarded("beginning a read transaction",
+                        [&]() noexcept { return mdb_txn_renew(m_reader); }) == MDB_SUCCESS) {
                 return m_reader;
             }
             mdb_txn_abort(m_reader);
             m_reader = nullptr;
         }
-        const int rc = mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &m_reader);
+        const int rc = Guarded("beginning a read transaction", [&]() noexcept {
+            return mdb_txn_begin(m_env, nullptr, MDB_RDONLY, &m_reader);
+        });
         if (rc == MDB_SUCCESS) {
             return m_reader;
         }
         m_reader = nullptr;
         if (rc == MDB_MAP_RESIZED && attempt == 0) {
-            Check(mdb_env_set_mapsize(m_env, 0), "adopting the grown map size");
+            SetMapSize(0, "adopting the grown map size");
             continue;
         }
         Check(rc, "beginning a read transaction");
@@ -735,11 +1071,12 @@ MDB_txn* LmdbStore::BeginRead() {
 
 std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     ReadScope read(*this);
     const auto keyBytes = IdentityKey(oid);
     MDB_val key = Val(keyBytes.data(), keyBytes.size());
     MDB_val value;
-    const int rc = mdb_get(read.Txn(), m_images, &key, &value);
+    const int rc = Get(read.Txn(), m_images, &key, &value, "reading an image");
     if (rc == MDB_NOTFOUND) {
         return std::nullopt;
     }
@@ -747,7 +1084,7 @@ std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
         Check(rc, "reading image " + OidText(oid));
     }
     try {
-        return DecodeImageRecord(oid, {static_cast<const octet_t*>(value.mv_data), value.mv_size});
+        return DecodeImageRecord(oid, Bytes(value));
     } catch (const RuntimeError& e) {
         Fail(e.what());
     }
@@ -755,6 +1092,7 @@ std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
 
 std::optional<uint64> LmdbStore::FindRoot(std::string_view name) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     const auto it = m_state->roots.find(name);
     if (it == m_state->roots.end()) {
         return std::nullopt;
@@ -764,11 +1102,13 @@ std::optional<uint64> LmdbStore::FindRoot(std::string_view name) {
 
 std::map<std::string, uint64> LmdbStore::Roots() {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     return {m_state->roots.begin(), m_state->roots.end()};
 }
 
 std::optional<uint64> LmdbStore::FindCounter(std::string_view name) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     const auto it = m_state->counters.find(name);
     if (it == m_state->counters.end()) {
         return std::nullopt;
@@ -787,7 +1127,9 @@ public:
             m_txn = store.BeginRead();
             return;
         }
-        const int rc = mdb_txn_begin(store.m_env, nullptr, MDB_RDONLY, &m_txn);
+        const int rc = store.Guarded("beginning a read transaction", [&]() noexcept {
+            return mdb_txn_begin(store.m_env, nullptr, MDB_RDONLY, &m_txn);
+        });
         if (rc == MDB_MAP_RESIZED) {
             store.Fail("the writer has grown the store since it was opened here; open it again");
         }
@@ -812,6 +1154,7 @@ private:
 
 std::optional<uint64> LmdbStore::FindLatestCounter(std::string_view name) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     if (!m_readOnly) {
         // The writer's own record is the latest.
         const auto it = m_state->counters.find(name);
@@ -829,6 +1172,15 @@ std::optional<uint64> LmdbStore::FindLatestCounter(std::string_view name) {
 
 void LmdbStore::CopyTo(const std::string& dir, bool compact) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
+    // A compacting copy walks every page of the latest commit in LMDB's
+    // copying code, which runs a second thread that no guard could leave
+    // behind: the pages are walked with plain reads first (at about the
+    // cost of the copy's own walk). A plain copy writes the file's pages out
+    // as they are, reading none.
+    if (compact) {
+        CheckLmdbPages(m_dir);
+    }
     const int rc = mdb_env_copy2(m_env, dir.c_str(), compact ? MDB_CP_COMPACT : 0);
     if (rc == MDB_MAP_RESIZED) {
         Fail("the writer has grown the store since it was opened here; open it again");
@@ -848,6 +1200,7 @@ void LmdbStore::CopyTo(const std::string& dir, bool compact) {
 
 uint64 LmdbStore::NextIdentity() {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     return m_state->nextIdentity;
 }
 
@@ -857,6 +1210,7 @@ void LmdbStore::Commit(const CommitBatch& batch) {
         TARN_ASSERT(write.first != 0);
     }
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     // The new meta values are made in a copy, which replaces the store's
     // once the transaction has committed: a failed commit leaves them as
     // they were.
@@ -866,6 +1220,10 @@ void LmdbStore::Commit(const CommitBatch& batch) {
     // store has no image for is not an error.
     WriteTransaction([&](MDB_txn* txn) {
         next = *m_state;  // afresh whenever the transaction is run again
+        // The pages of the latest commit, which this transaction builds on.
+        MDB_envinfo info;
+        CheckGuarded("committing", [&]() noexcept { return mdb_env_info(m_env, &info); });
+        const uint64 pages = static_cast<uint64>(info.me_last_pgno) + 1;
         // The image bytes follow every change: the size of a record replaced
         // or deleted is looked up first. That is one more descent of the tree
         // per image, through the pages the write or the deletion then
@@ -875,29 +1233,41 @@ void LmdbStore::Commit(const CommitBatch& batch) {
             const auto keyBytes = IdentityKey(oid);
             MDB_val key = Val(keyBytes.data(), keyBytes.size());
             MDB_val old;
-            if (const int rc = mdb_get(txn, m_images, &key, &old); rc == MDB_SUCCESS) {
-                Uncount(next, old.mv_size);
-            } else if (rc != MDB_NOTFOUND) {
-                Check(rc, "commit: reading image " + OidText(oid));
-            }
             MDB_val value{ImageRecordSize(image), nullptr};
-            if (const int rc = mdb_put(txn, m_images, &key, &value, MDB_RESERVE); rc != 0) {
+            int found = MDB_NOTFOUND;
+            const int rc = Guarded("committing", [&]() noexcept {
+                found = mdb_get(txn, m_images, &key, &old);
+                const int run = found == MDB_SUCCESS ? CheckOverflowRun(old, pages) : MDB_SUCCESS;
+                if ((found != MDB_SUCCESS && found != MDB_NOTFOUND) || run != MDB_SUCCESS) {
+                    return found != MDB_SUCCESS ? found : run;
+                }
+                return mdb_put(txn, m_images, &key, &value, MDB_RESERVE);
+            });
+            if (rc != MDB_SUCCESS) {
                 Check(rc, "commit: writing image " + OidText(oid));
             }
             EncodeImageRecord(oid, image, static_cast<octet_t*>(value.mv_data));
+            if (found == MDB_SUCCESS) {
+                Uncount(next, old.mv_size);
+            }
             next.imageBytes += value.mv_size;
         }
         for (const uint64 oid : batch.deletes) {
             const auto keyBytes = IdentityKey(oid);
             MDB_val key = Val(keyBytes.data(), keyBytes.size());
             MDB_val old;
-            const int found = mdb_get(txn, m_images, &key, &old);
-            if (found == MDB_NOTFOUND) {
+            const int rc = Guarded("committing", [&]() noexcept {
+                const int found = mdb_get(txn, m_images, &key, &old);
+                const int run = found == MDB_SUCCESS ? CheckOverflowRun(old, pages) : MDB_SUCCESS;
+                return found != MDB_SUCCESS ? found
+                       : run != MDB_SUCCESS ? run
+                                            : mdb_del(txn, m_images, &key, nullptr);
+            });
+            if (rc == MDB_NOTFOUND) {
                 continue;
             }
-            Check(found, "commit: reading image " + OidText(oid));
+            Check(rc, "commit: deleting image " + OidText(oid));
             Uncount(next, old.mv_size);
-            Check(mdb_del(txn, m_images, &key, nullptr), "commit: deleting image " + OidText(oid));
         }
         for (const auto& [name, oid] : batch.roots) {
             if (name.size() > kMaxNameBytes) {
@@ -924,16 +1294,17 @@ void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
         chunk.clear();
         {
             std::lock_guard lock(m_mutex);
+            ThrowIfPoisoned();
             ReadScope read(*this);
-            int rc = 0;
-            Cursor cursor(read.Txn(), m_images, &rc);
-            Check(rc, "listing the images");
+            Cursor cursor(*this, read.Txn(), m_images, "listing the images");
             const auto fromBytes = IdentityKey(from);
             MDB_val key = Val(fromBytes.data(), fromBytes.size());
             MDB_val value;
-            for (rc = cursor.Get(&key, &value, MDB_SET_RANGE);
+            const auto touching = Cursor::Touching::Key;
+            int rc = 0;
+            for (rc = cursor.Get(&key, &value, MDB_SET_RANGE, touching);
                  rc == MDB_SUCCESS && chunk.size() < kIdentityChunk;
-                 rc = cursor.Get(&key, &value, MDB_NEXT)) {
+                 rc = cursor.Get(&key, &value, MDB_NEXT, touching)) {
                 if (key.mv_size != 8) {
                     Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
                          " bytes, expected 8");
@@ -956,13 +1327,12 @@ void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
 
 std::optional<uint64> LmdbStore::LargestIdentity() {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     ReadScope read(*this);
-    int rc = 0;
-    Cursor cursor(read.Txn(), m_images, &rc);
-    Check(rc, "finding the largest identity");
+    Cursor cursor(*this, read.Txn(), m_images, "finding the largest identity");
     MDB_val key;
     MDB_val value;
-    rc = cursor.Get(&key, &value, MDB_LAST);
+    const int rc = cursor.Get(&key, &value, MDB_LAST, Cursor::Touching::Key);
     if (rc == MDB_NOTFOUND) {
         return std::nullopt;
     }
@@ -976,9 +1346,11 @@ std::optional<uint64> LmdbStore::LargestIdentity() {
 
 StoreStats LmdbStore::Stats() {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     ReadScope read(*this);
     MDB_stat stat;
-    Check(mdb_stat(read.Txn(), m_images, &stat), "counting the images");
+    CheckGuarded("counting the images",
+                 [&]() noexcept { return mdb_stat(read.Txn(), m_images, &stat); });
     StoreStats stats;
     stats.numImages = static_cast<ssize_t>(stat.ms_entries);
     // A format-1 store read as it is kept no count of the bytes: they are
@@ -990,22 +1362,22 @@ StoreStats LmdbStore::Stats() {
 
 uint64 LmdbStore::DataBytes(bool withoutFreePages) {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     MDB_envinfo info;
-    Check(mdb_env_info(m_env, &info), "reading the environment's size");
-    MDB_stat stat;
-    Check(mdb_env_stat(m_env, &stat), "reading the environment's page size");
+    CheckGuarded("reading the environment's size",
+                 [&]() noexcept { return mdb_env_info(m_env, &info); });
     uint64 pages = static_cast<uint64>(info.me_last_pgno) + 1;
     if (withoutFreePages) {
         // LMDB's free list is its database 0: a record per transaction whose
         // value is an array of page numbers, the first element their count.
         LatestRead read(*this);
-        int rc = 0;
-        Cursor cursor(read.Txn(), 0, &rc);
-        Check(rc, "reading the free list");
+        Cursor cursor(*this, read.Txn(), 0, "reading the free list");
         MDB_val key;
         MDB_val value;
         uint64 free = 0;
-        while ((rc = cursor.Get(&key, &value, MDB_NEXT)) == MDB_SUCCESS) {
+        int rc = 0;
+        while ((rc = cursor.Get(&key, &value, MDB_NEXT, Cursor::Touching::KeyAndValue)) ==
+               MDB_SUCCESS) {
             if (value.mv_size >= sizeof(std::size_t)) {
                 std::size_t count;
                 std::memcpy(&count, value.mv_data, sizeof count);
@@ -1017,13 +1389,14 @@ uint64 LmdbStore::DataBytes(bool withoutFreePages) {
         }
         pages -= std::min(free, pages);
     }
-    return pages * stat.ms_psize;
+    return pages * m_pageSize;
 }
 
 std::size_t LmdbStore::MapSize() {
     std::lock_guard lock(m_mutex);
+    ThrowIfPoisoned();
     MDB_envinfo info;
-    Check(mdb_env_info(m_env, &info), "reading the map size");
+    CheckGuarded("reading the map size", [&]() noexcept { return mdb_env_info(m_env, &info); });
     return info.me_mapsize;
 }
 
@@ -1031,12 +1404,24 @@ void LmdbStore::Fail(const std::string& what) const {
     FailAt(m_dir, what);
 }
 
-void LmdbStore::Check(int rc, std::string_view doing) const {
+// LMDB's codes for damage it found in its pages poison the store as a fault
+// does: LMDB refuses to go on with a transaction that met one (a ReadOnly
+// store's snapshot among them), and a writer must not go on changing a tree
+// it found damaged.
+void LmdbStore::Check(int rc, std::string_view doing) {
     if (rc == MDB_SUCCESS) {
         return;
     }
     if (rc == MDB_MAP_FULL) {
         throw MapFull{};
+    }
+    if (rc == MDB_PAGE_NOTFOUND || rc == MDB_CORRUPTED || rc == MDB_CURSOR_FULL ||
+        rc == kPastTheMap || rc == kDamagedRun) {
+        m_poisoned = "LMDB store '" + m_dir + "': damaged store: " + std::string(doing) + ": " +
+                     (rc == kPastTheMap   ? "LMDB places a key or value past the end of its map"
+                      : rc == kDamagedRun ? "the header of its overflow pages is damaged"
+                                          : mdb_strerror(rc));
+        throw RuntimeError(m_poisoned);
     }
     Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)));
 }

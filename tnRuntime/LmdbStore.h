@@ -91,17 +91,29 @@
 // - Faults: a missing directory (when it must exist), a directory that is not
 //   a store, a foreign or damaged file, permission problems and damaged
 //   records are all reported as RuntimeError naming the directory and, for a
-//   record, the identity. The record frame guards the image bytes. LMDB
-//   trusts its own pages, so before it maps the files (tnRuntime/
-//   LmdbFileCheck.h) data.mdb is checked against its meta pages (a short file
-//   would fault when touched) and its branch and leaf pages are walked, and
-//   lock.mdb's header is checked: a damaged lock file nobody uses is made
-//   anew and reported in Repairs(). Damage LMDB detects itself
-//   (MDB_CORRUPTED) arrives as a RuntimeError too. A write failed for a full
-//   disk says "no space left on device". Misuse by the caller (writing
-//   identity 0, committing to a read-only store) asserts.
+//   record, the identity. The record frame guards the image bytes, and the
+//   meta record's checksum the meta values. Before LMDB maps the files
+//   (tnRuntime/LmdbFileCheck.h), data.mdb is checked against its meta pages
+//   (a short file would fault when touched) and lock.mdb's header is
+//   checked: a few reads, whatever the size of the store. A damaged lock
+//   file nobody uses is made anew and reported in Repairs(). Opening reads
+//   no branch or leaf page: LMDB reads them as the calls need them, and
+//   trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND, MDB_CORRUPTED,
+//   MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map while it reads
+//   a page (caught by a page guard: see LmdbStore.cpp; the first Open
+//   installs a process-wide handler for both signals, chained to the one
+//   before it), arrive as a RuntimeError "damaged store: ..." and poison the
+//   store: every later call throws the same error and nothing more is
+//   committed. A writer checks the header of each run of overflow pages it is
+//   about to free. A page that is sound in itself but wrong can still give a
+//   wrong answer (most often an image not found). CheckLmdbPages walks every
+//   page, for whole-store validation and backups; a compacting CopyTo runs
+//   it itself. A write failed for a full disk says "no space left on
+//   device". Misuse by the caller (writing identity 0, committing to a
+//   read-only store) asserts.
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -112,6 +124,7 @@
 
 struct MDB_env;
 struct MDB_txn;
+struct MDB_val;
 
 namespace tarn {
 
@@ -154,13 +167,16 @@ public:
     StoreStats Stats() override;
 
     // The named counter as the latest commit holds it, also for a ReadOnly
-    // store (whose other reads see its snapshot).
+    // store (whose other reads see its snapshot): a ReadOnly store reads and
+    // verifies the latest meta record (or format-1 keys) for it.
     std::optional<uint64> FindLatestCounter(std::string_view name);
     // Writes a copy of the environment as of the latest commit into the
     // existing directory `dir`, as its data.mdb (which must not exist yet),
     // synced. `compact` leaves out free pages and renumbers the rest, so the
-    // copy is as small as its contents. Runs beside the writer; a copy holds
-    // one commit, whatever the writer commits meanwhile.
+    // copy is as small as its contents; it walks every page with
+    // CheckLmdbPages first (LMDB's compacting copy reads them all
+    // unguarded). Runs beside the writer; a copy holds one commit, whatever
+    // the writer commits meanwhile.
     void CopyTo(const std::string& dir, bool compact);
     // The bytes of the data file that the latest commit uses, or (when
     // `withoutFreePages`) about what a compacting copy of it takes.
@@ -180,11 +196,14 @@ public:
 private:
     class ReadScope;
     class LatestRead;
+    class Cursor;
 
     LmdbStore(std::string dir, const LmdbStoreOptions& options);
 
     void LockDirectory();
     void OpenEnvironment();
+    void FindMap();
+    void SetMapSize(std::size_t size, const char* doing);
     void OpenDatabases(OpenMode mode);
     void BeginSnapshot();
     LmdbStoreState ReadState(MDB_txn* txn, uint32* version, std::vector<std::string>* oldKeys);
@@ -195,9 +214,18 @@ private:
     void WriteTransaction(Apply&& apply);
     void GrowMap();
     MDB_txn* BeginRead();
+    template <class Call>
+    int Guarded(const char* doing, Call&& call);
+    template <class Call>
+    void CheckGuarded(const char* doing, Call&& call);
+    int Touch(const MDB_val& val) const noexcept;
+    int CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept;
+    int Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value, const char* doing);
+    [[noreturn]] void PageFault(const char* doing, int signal, std::uintptr_t address);
+    void ThrowIfPoisoned() const;
 
     [[noreturn]] void Fail(const std::string& what) const;
-    void Check(int rc, std::string_view doing) const;
+    void Check(int rc, std::string_view doing);
 
     std::string m_dir;
     LmdbStoreOptions m_options;
@@ -206,6 +234,12 @@ private:
     bool m_registered = false;                // the directory is entered as open in this process
     std::pair<uint64, uint64> m_dirId{0, 0};  // the directory's device and inode
     MDB_env* m_env = nullptr;
+    // Where data.mdb is mapped (0, 0: not known), for the page guards.
+    std::uintptr_t m_mapBegin = 0;
+    std::uintptr_t m_mapEnd = 0;
+    std::size_t m_pageSize = 0;
+    // Once LMDB met a damaged page: the error every call throws.
+    std::string m_poisoned;
     // A writer's reader: a reset read transaction, renewed per read. A
     // ReadOnly store's snapshot: one read transaction for its lifetime.
     MDB_txn* m_reader = nullptr;
