@@ -48,7 +48,7 @@
 //
 // Decisions:
 // - Atomicity: a Commit is one LMDB write transaction (images written, images
-//   deleted, roots, counter). LMDB's copy-on-write pages and its two meta
+//   deleted, the meta record). LMDB's copy-on-write pages and its two meta
 //   pages make the transaction all or nothing: after a crash the store holds
 //   the previous commit or the new one. Commits are synced to disk unless
 //   LmdbStoreOptions::syncOnCommit is off.
@@ -85,32 +85,33 @@
 //   latest when it was opened, whatever the writer commits meanwhile; open
 //   it again to see newer commits. While it is open the writer cannot reuse
 //   the pages of that commit, so the file grows faster: keep readers short.
-//   A writable store reads the latest commit at every call.
+//   A writable store reads the latest commit, its own, at every call.
 // - Threads: every member may be called from any thread; calls are serialised
 //   by an internal mutex. A store must not be used in a child after fork().
-// - Faults: a missing directory (when it must exist), a directory that is not
-//   a store, a foreign or damaged file, permission problems and damaged
-//   records are all reported as RuntimeError naming the directory and, for a
-//   record, the identity. The record frame guards the image bytes, and the
-//   meta record's checksum the meta values. Before LMDB maps the files
-//   (tnRuntime/LmdbFileCheck.h), data.mdb is checked against its meta pages
-//   (a short file would fault when touched) and lock.mdb's header is
-//   checked: a few reads, whatever the size of the store. A damaged lock
-//   file nobody uses is made anew and reported in Repairs(). Opening reads
-//   no branch or leaf page: LMDB reads them as the calls need them, and
-//   trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND, MDB_CORRUPTED,
-//   MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map while it reads
-//   a page (caught by a page guard: see LmdbStore.cpp; the first Open
-//   installs a process-wide handler for both signals, chained to the one
+// - Faults: a missing directory (when it must exist), a directory that is not a
+//   store, a foreign or damaged file, permission problems and damaged records
+//   are all reported as RuntimeError naming the directory and, for a record,
+//   the identity. The record frame guards the image bytes, and the meta
+//   record's checksum the meta values. Before LMDB maps the files
+//   (tnRuntime/LmdbFileCheck.h), data.mdb is checked against its meta pages (a
+//   short file would fault when touched) and lock.mdb's header is checked: a
+//   few reads, whatever the size of the store. A damaged lock file nobody uses
+//   is made anew and reported in Repairs(). Opening walks no tree: it reads the
+//   few pages that lead to the meta record (and the images' leaves when it
+//   upgrades a format-1 store); LMDB reads the other pages as the calls need
+//   them, and trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND,
+//   MDB_CORRUPTED, MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map
+//   while it reads a page (caught by a page guard: see LmdbStore.cpp; the first
+//   Open installs a process-wide handler for both signals, chained to the one
 //   before it), arrive as a RuntimeError "damaged store: ..." and poison the
 //   store: every later call throws the same error and nothing more is
 //   committed. A writer checks the header of each run of overflow pages it is
 //   about to free. A page that is sound in itself but wrong can still give a
 //   wrong answer (most often an image not found). CheckLmdbPages walks every
-//   page, for whole-store validation and backups; a compacting CopyTo runs
-//   it itself. A write failed for a full disk says "no space left on
-//   device". Misuse by the caller (writing identity 0, committing to a
-//   read-only store) asserts.
+//   page, for whole-store validation and backups; a compacting CopyTo runs it
+//   itself. A write failed for a full disk says "no space left on device".
+//   Misuse by the caller (writing identity 0, committing to a read-only store)
+//   asserts.
 
 #include <cstddef>
 #include <cstdint>
