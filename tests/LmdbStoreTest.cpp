@@ -651,6 +651,10 @@ public:
     void SetNodeOffset(uint64 page, std::size_t index, uint64 offset) {
         Put(page * m_pageSize + 16 + 2 * index, offset, 2);
     }
+    void SetNodeFlags(uint64 page, uint64 node, uint64 flags) {
+        Put(page * m_pageSize + node + 4, flags, 2);
+    }
+    void SetLowerBound(uint64 page, uint64 lower) { Put(page * m_pageSize + 12, lower, 2); }
     // A leaf node's first overflow page (a node with flag 0x01 holds its
     // page number as its data), and the run's page count (at byte 12).
     uint64 Overflow(uint64 page, uint64 node) const {
@@ -820,6 +824,45 @@ TEST(LmdbStorePageFaults, AReadPastTheEndOfTheFileIsConfinedToAnError) {
     EXPECT_EQ(reader->Load(1)->bytes, MakeImage(7, 1, 40).bytes);
 }
 
+// Two more ways in which LMDB meets a damaged page, confined the same way: a
+// node flagged as holding duplicate keys (this store makes no such
+// database, and LMDB follows a null pointer), and a branch page left with
+// one key (one of LMDB's own assertions, which would abort the process).
+TEST(LmdbStorePageFaults, NullPointersAndAssertionsOfLmdbAreConfinedToAnError) {
+    TempDir dir;
+    const std::string original = dir.Sub("original");
+    MakeBranchyStore(original);
+    const std::string copy = dir.Sub("copy");
+    const struct {
+        std::function<uint64(DataFile&)> damage;  // returns an identity it hits
+        std::string error;
+    } cases[] = {
+        {[](DataFile& file) {
+             const uint64 leaf = file.Leaves(file.Root("images")).at(0);
+             const uint64 node = file.Nodes(leaf).at(2);
+             file.SetNodeFlags(leaf, node, 0x04);
+             return IdentityOfKeyText(file.Key(leaf, node));
+         },
+         "damaged store: a page of data.mdb led LMDB to a null pointer while reading an image "
+         "(SIGSEGV at address "},
+        {[](DataFile& file) {
+             file.SetLowerBound(file.Root("images"), 18);
+             return uint64{1};
+         },
+         "damaged store: LMDB found its pages inconsistent while reading an image ("},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.error);
+        CopyStore(original, copy);
+        DataFile file(copy + "/data.mdb");
+        const uint64 hit = c.damage(file);
+        file.Write();
+        auto store = OpenScratch(copy, OpenMode::ReadOnly);
+        EXPECT_ERROR_MENTIONS(store->Load(hit), c.error);
+        EXPECT_ERROR_MENTIONS(store->NextIdentity(), c.error);
+    }
+}
+
 // LMDB frees as many pages as the first header of an image's overflow run
 // says when the image is replaced or deleted: a writer refuses to do so with
 // a damaged count (which would hand pages in use to later writes, or append
@@ -868,11 +911,11 @@ TEST(LmdbStorePageFaults, AWriterFreesNoOverflowRunWithADamagedCount) {
     }
 }
 
-// The page guards' handler passes a fault outside every map on: the process
-// ends as it would without a store (by the signal, or through the
-// sanitizer's report in a sanitized build), neither carrying on nor
-// faulting forever.
-TEST(LmdbStorePageFaults, AFaultOutsideTheMapEndsTheProcessAsBefore) {
+// The page guards' handler passes on a fault outside every guard (here a
+// null pointer's, which inside a guard would be confined): the process ends
+// as it would without a store (by the signal, or through the sanitizer's
+// report in a sanitized build), neither carrying on nor faulting forever.
+TEST(LmdbStorePageFaults, AFaultOutsideEveryGuardEndsTheProcessAsBefore) {
     TempDir dir;
     MakeBranchyStore(dir.Path());
     const pid_t pid = ::fork();

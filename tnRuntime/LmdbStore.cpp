@@ -66,6 +66,8 @@ constexpr std::string_view kCounterPrefix = "counter:";
 // callback runs with no transaction open and may use the store itself.
 constexpr std::size_t kIdentityChunk = 1024;
 
+}  // namespace
+
 // What LMDB checks of its own pages, and what this store adds.
 //
 // Debian's LMDB (0.9.24, as tried with damaged files) bounds every page
@@ -82,26 +84,33 @@ constexpr std::size_t kIdentityChunk = 1024;
 // (SIGSEGV); so can a data.mdb cut short while it is open.
 //
 // The store runs every LMDB call that reads pages, and its own reads of the
-// keys and values LMDB returns, under a PageGuard: a SIGSEGV or SIGBUS of the
-// thread inside a guard whose faulting address lies inside this
-// environment's map jumps back to the guard (sigsetjmp/siglongjmp, from a
-// process-wide handler chained to the handler installed before it) and
-// becomes a RuntimeError; the store is then poisoned (see PageFault). Any
-// other fault goes on to the previous handler, or to the default action,
-// unchanged. Between the guard's sigsetjmp and the call's end there are only
-// LMDB's C frames and objects without destructors, so the jump skips no
-// destructor; what LMDB was doing is abandoned, which is why the store is
-// poisoned.
+// keys and values LMDB returns, under a page guard (LmdbPageGuard). A
+// SIGSEGV or SIGBUS of the thread inside a guard whose faulting address lies
+// inside this environment's map jumps back to the guard
+// (sigsetjmp/siglongjmp, from a process-wide handler chained to the handler
+// installed before it) and becomes a RuntimeError; the store is then
+// poisoned (see PageFault). So do two more ways in which LMDB meets a
+// damaged page inside a guard: a fault in the first 64 KiB of the address
+// space, where a process has nothing mapped (LMDB follows a node's flags to a
+// structure this store never makes, such as the cursor of a duplicate-keys
+// database, and dereferences its null pointer), and one of LMDB's own
+// assertions (which would abort the process: the environment's assert
+// callback jumps back instead). Any other fault goes on to the previous
+// handler, or to the default action, unchanged. Between the guard's
+// sigsetjmp and the call's end there are only LMDB's C frames and objects
+// without destructors, so the jump skips no destructor; what LMDB was doing
+// is abandoned, which is why the store is poisoned.
 //
-// Limits: a read that runs past the end of the map (a page at the very end
-// of a full map) is not confined. A page that is sound in itself but wrong
-// (a child page number naming another leaf) gives a wrong answer without a
+// Limits: any other fault stays unconfined: a read past the end of the map
+// (from a page at the very end of a full map), or at a wild address LMDB
+// computed from a damaged page. A page that is sound in itself but wrong (a
+// child page number naming another leaf) gives a wrong answer without a
 // fault: most often "no such image"; a record found instead of another fails
 // its checksum, which binds it to its identity, and the meta record has a
-// checksum of its own. CheckLmdbPages (tnRuntime/LmdbFileCheck.h) walks every
-// page for a whole-store validation. A program that installs its own SIGSEGV
-// or SIGBUS handler after the first store was opened takes the faults from
-// the guard (then they end as they would without it).
+// checksum of its own. CheckLmdbPages (tnRuntime/LmdbFileCheck.h) walks
+// every page for a whole-store validation. A program that installs its own
+// SIGSEGV or SIGBUS handler after the first store was opened takes the
+// faults from the guard (then they end as they would without it).
 //
 // AddressSanitizer installs its handlers for both signals at start-up. Under
 // its default options (handle_segv=1, allow_user_segv_handler=1; as tried
@@ -109,17 +118,26 @@ constexpr std::size_t kIdentityChunk = 1024;
 // on to them, so a sanitized program still reports its wild accesses; no
 // option is needed. (handle_segv=2 would keep any handler but the
 // sanitizer's from being installed: the guards would then confine nothing.)
-struct PageGuard {
+struct LmdbPageGuard {
     sigjmp_buf jump;
+    const MDB_env* env = nullptr;
     std::uintptr_t mapBegin = 0;
     std::uintptr_t mapEnd = 0;
-    PageGuard* outer = nullptr;  // a guard this one runs inside of
+    LmdbPageGuard* outer = nullptr;  // a guard this one runs inside of
     volatile std::uintptr_t faultAddress = 0;
-    volatile int faultSignal = 0;
+    volatile int faultSignal = 0;  // 0: an assertion of LMDB's
+    char assertion[256] = {};
 };
 
+namespace {
+
+// Linux maps nothing into the lowest pages of a process (vm.mmap_min_addr: 4
+// or 64 KiB by default), and the store maps nothing near them: a fault below
+// this address inside a guard is LMDB dereferencing a null pointer.
+constexpr std::uintptr_t kNullPageBytes = std::uintptr_t{1} << 16;
+
 // The innermost active guard of the thread.
-constinit thread_local PageGuard* t_pageGuard = nullptr;
+constinit thread_local LmdbPageGuard* t_pageGuard = nullptr;
 
 // The handlers installed before this store's, by signal.
 struct sigaction g_previousSegv;
@@ -149,14 +167,28 @@ void PassFaultOn(int signal, siginfo_t* info, void* context) {
 }
 
 void OnFault(int signal, siginfo_t* info, void* context) {
-    PageGuard* guard = t_pageGuard;
+    LmdbPageGuard* guard = t_pageGuard;
     const auto address = reinterpret_cast<std::uintptr_t>(info->si_addr);
-    if (guard != nullptr && address >= guard->mapBegin && address < guard->mapEnd) {
+    if (guard != nullptr &&
+        ((address >= guard->mapBegin && address < guard->mapEnd) || address < kNullPageBytes)) {
         guard->faultAddress = address;
         guard->faultSignal = signal;
         siglongjmp(guard->jump, 1);
     }
     PassFaultOn(signal, info, context);
+}
+
+// LMDB's assert callback: inside a guard of the environment, the assertion
+// ends the guarded call instead of the process. Otherwise LMDB goes on to
+// print it and abort, as without the callback.
+void OnLmdbAssertion(MDB_env* env, const char* message) {
+    LmdbPageGuard* guard = t_pageGuard;
+    if (guard == nullptr || guard->env != env) {
+        return;
+    }
+    std::snprintf(guard->assertion, sizeof guard->assertion, "%s", message);
+    guard->faultSignal = 0;
+    siglongjmp(guard->jump, 1);
 }
 
 // Installs OnFault for SIGSEGV and SIGBUS, once per process. SA_NODEFER
@@ -463,13 +495,14 @@ private:
 template <class Call>
 int LmdbStore::Guarded(const char* doing, Call&& call) {
     static_assert(std::is_nothrow_invocable_r_v<int, Call>, "a guarded call may not throw");
-    PageGuard guard;
+    LmdbPageGuard guard;
+    guard.env = m_env;
     guard.mapBegin = m_mapBegin;
     guard.mapEnd = m_mapEnd;
     guard.outer = t_pageGuard;
     if (sigsetjmp(guard.jump, 0) != 0) {
         t_pageGuard = guard.outer;
-        PageFault(doing, guard.faultSignal, guard.faultAddress);
+        PageFault(doing, guard);
     }
     t_pageGuard = &guard;
     const int rc = call();
@@ -539,20 +572,29 @@ int LmdbStore::CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept
 // trusted any more, so the store is poisoned: this call and every later one
 // throw the same error. What can be aborted is aborted as the error unwinds
 // (a write transaction, a read scope); nothing is committed.
-void LmdbStore::PageFault(const char* doing, int signal, std::uintptr_t address) {
-    const std::uintptr_t offset = address - m_mapBegin;
-    std::string fileBytes = "an unknown number of";
-    int fd = -1;
-    struct stat st;
-    if (mdb_env_get_fd(m_env, &fd) == MDB_SUCCESS && ::fstat(fd, &st) == 0) {
-        fileBytes = std::to_string(st.st_size);
+void LmdbStore::PageFault(const char* doing, const LmdbPageGuard& guard) {
+    const std::string damaged = "LMDB store '" + m_dir + "': damaged store: ";
+    const std::uintptr_t address = guard.faultAddress;
+    const std::string signal = guard.faultSignal == SIGBUS ? "SIGBUS" : "SIGSEGV";
+    if (guard.faultSignal == 0) {
+        m_poisoned = damaged + "LMDB found its pages inconsistent while " + doing + " (" +
+                     guard.assertion + ")";
+    } else if (address < kNullPageBytes) {
+        m_poisoned = damaged + "a page of data.mdb led LMDB to a null pointer while " + doing +
+                     " (" + signal + " at address " + std::to_string(address) + ")";
+    } else {
+        const std::uintptr_t offset = address - m_mapBegin;
+        std::string fileBytes = "an unknown number of";
+        int fd = -1;
+        struct stat st;
+        if (mdb_env_get_fd(m_env, &fd) == MDB_SUCCESS && ::fstat(fd, &st) == 0) {
+            fileBytes = std::to_string(st.st_size);
+        }
+        m_poisoned = damaged + "a page of data.mdb could not be read while " + doing + " (" +
+                     signal + " at byte " + std::to_string(offset) + " of the map, in page " +
+                     std::to_string(offset / std::max<std::size_t>(m_pageSize, 1)) +
+                     "; data.mdb has " + fileBytes + " bytes)";
     }
-    m_poisoned = "LMDB store '" + m_dir +
-                 "': damaged store: a page of data.mdb could not be read while " + doing + " (" +
-                 (signal == SIGBUS ? "SIGBUS" : "SIGSEGV") + " at byte " + std::to_string(offset) +
-                 " of the map, in page " +
-                 std::to_string(offset / std::max<std::size_t>(m_pageSize, 1)) + "; data.mdb has " +
-                 fileBytes + " bytes)";
     throw RuntimeError(m_poisoned);
 }
 
@@ -698,6 +740,8 @@ void LmdbStore::LockDirectory() {
 void LmdbStore::OpenEnvironment() {
     InstallFaultHandler();
     Check(mdb_env_create(&m_env), "creating the environment");
+    // (A library built without assertions takes no callback; nothing is lost.)
+    mdb_env_set_assert(m_env, OnLmdbAssertion);
     Check(mdb_env_set_maxdbs(m_env, 2), "configuring the environment");
     Check(mdb_env_set_mapsize(m_env, m_options.initialMapSize), "setting the map size");
     unsigned int flags = MDB_NOTLS;

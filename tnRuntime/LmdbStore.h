@@ -100,18 +100,18 @@
 //   few pages that lead to the meta record (and the images' leaves when it
 //   upgrades a format-1 store); LMDB reads the other pages as the calls need
 //   them, and trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND,
-//   MDB_CORRUPTED, MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map
-//   while it reads a page (caught by a page guard: see LmdbStore.cpp; the first
-//   Open installs a process-wide handler for both signals, chained to the one
-//   before it), arrive as a RuntimeError "damaged store: ..." and poison the
-//   store: every later call throws the same error and nothing more is
-//   committed. A writer checks the header of each run of overflow pages it is
-//   about to free. A page that is sound in itself but wrong can still give a
-//   wrong answer (most often an image not found). CheckLmdbPages walks every
-//   page, for whole-store validation and backups; a compacting CopyTo runs it
-//   itself. A write failed for a full disk says "no space left on device".
-//   Misuse by the caller (writing identity 0, committing to a read-only store)
-//   asserts.
+//   MDB_CORRUPTED, MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map (or
+//   at a null pointer), or one of LMDB's assertions, while it reads a page
+//   (caught by a page guard: see LmdbStore.cpp; the first Open installs a
+//   process-wide handler for both signals, chained to the one before it),
+//   arrive as a RuntimeError "damaged store: ..." and poison the store: every
+//   later call throws the same error and nothing more is committed. A writer
+//   checks the header of each run of overflow pages it is about to free. A page
+//   that is sound in itself but wrong can still give a wrong answer (most often
+//   an image not found). CheckLmdbPages walks every page, for whole-store
+//   validation and backups; a compacting CopyTo runs it itself. A write failed
+//   for a full disk says "no space left on device". Misuse by the caller
+//   (writing identity 0, committing to a read-only store) asserts.
 
 #include <cstddef>
 #include <cstdint>
@@ -130,6 +130,7 @@ struct MDB_val;
 namespace tarn {
 
 struct LmdbStoreState;
+struct LmdbPageGuard;
 
 enum class OpenMode {
     CreateIfMissing,  // make the directory and an empty store when there is none
@@ -222,7 +223,7 @@ private:
     int Touch(const MDB_val& val) const noexcept;
     int CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept;
     int Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value, const char* doing);
-    [[noreturn]] void PageFault(const char* doing, int signal, std::uintptr_t address);
+    [[noreturn]] void PageFault(const char* doing, const LmdbPageGuard& guard);
     void ThrowIfPoisoned() const;
 
     [[noreturn]] void Fail(const std::string& what) const;
