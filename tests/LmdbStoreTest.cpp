@@ -655,6 +655,7 @@ public:
         Put(page * m_pageSize + node + 4, flags, 2);
     }
     void SetLowerBound(uint64 page, uint64 lower) { Put(page * m_pageSize + 12, lower, 2); }
+    void SetFlags(uint64 page, uint64 flags) { Put(page * m_pageSize + 10, flags, 2); }
     // A leaf node's first overflow page (a node with flag 0x01 holds its
     // page number as its data), and the run's page count (at byte 12).
     uint64 Overflow(uint64 page, uint64 node) const {
@@ -758,21 +759,12 @@ TEST(LmdbStorePageFaults, AChildPagePastTheEndOfTheFileIsAnError) {
         EXPECT_ERROR_MENTIONS(store->Load(1), damaged);
         EXPECT_ERROR_MENTIONS(store->FindRoot("head"), damaged);
     }
-    {
-        auto writer = OpenScratch(dir.Path(), OpenMode::MustExist);
-        CommitBatch batch;
-        batch.writes.emplace_back(cut, MakeImage(8, cut, 10));
-        batch.nextIdentity = 6000;
-        EXPECT_ERROR_MENTIONS(writer->Commit(batch), "damaged store: commit: writing image #");
-        EXPECT_ERROR_MENTIONS(writer->Commit(CommitBatch{}), "damaged store: commit: writing");
-    }
-    EXPECT_EQ(OpenScratch(dir.Path(), OpenMode::ReadOnly)->NextIdentity(), 5000u);
 }
 
 // A leaf whose node offsets point past the end of the file makes LMDB read
 // past it: a SIGBUS inside the map, which the page guard turns into a
-// damaged store, for this call and every later one. The process goes on;
-// the writer commits nothing, and a later opener reads the rest.
+// damaged store, for this call and every later one. The process goes on,
+// and a later opener reads the rest.
 TEST(LmdbStorePageFaults, AReadPastTheEndOfTheFileIsConfinedToAnError) {
     TempDir dir;
     MakeBranchyStore(dir.Path());
@@ -810,18 +802,39 @@ TEST(LmdbStorePageFaults, AReadPastTheEndOfTheFileIsConfinedToAnError) {
     EXPECT_ERROR_MENTIONS(
         OpenScratch(dir.Path(), OpenMode::ReadOnly)->ForEachIdentity([](uint64) {}),
         fault + "listing the images (SIGBUS");
-    {
-        auto writer = OpenScratch(dir.Path(), OpenMode::MustExist);
-        CommitBatch batch;
-        batch.writes.emplace_back(inLeaf, MakeImage(8, inLeaf, 10));
-        batch.nextIdentity = 6000;
-        EXPECT_ERROR_MENTIONS(writer->Commit(batch), fault + "committing (SIGBUS");
-        EXPECT_ERROR_MENTIONS(writer->Commit(CommitBatch{}), fault + "committing (SIGBUS");
-        EXPECT_ERROR_MENTIONS(writer->NextIdentity(), fault + "committing (SIGBUS");
-    }
     auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
     EXPECT_EQ(reader->NextIdentity(), 5000u);
     EXPECT_EQ(reader->Load(1)->bytes, MakeImage(7, 1, 40).bytes);
+}
+
+// A data.mdb cut short under a writer (after its walk of the pages, before
+// its next commit) makes LMDB fault inside the map in the middle of a
+// commit: the commit is aborted, never committed, and the writer takes no
+// further call.
+TEST(LmdbStorePageFaults, AFileCutShortUnderTheWriterStopsItsCommit) {
+    TempDir dir;
+    MakeBranchyStore(dir.Path());
+    const std::string path = dir.Sub("data.mdb");
+    CommitBatch first;
+    first.writes.emplace_back(2000, MakeImage(8, 2000, 10));
+    first.nextIdentity = 6000;
+    CommitBatch second = first;
+    second.writes[0].second = MakeImage(9, 2000, 10);
+    second.nextIdentity = 7000;
+    {
+        auto writer = OpenScratch(dir.Path(), OpenMode::MustExist);
+        writer->Commit(first);
+        const std::string committed = FileText(path);
+        fs::resize_file(path, 2 * 4096);
+        const std::string fault = "damaged store: a page of data.mdb could not be read while ";
+        EXPECT_ERROR_MENTIONS(writer->Commit(second), fault + "committing (SIGBUS");
+        EXPECT_ERROR_MENTIONS(writer->Load(1), fault + "committing (SIGBUS");
+        EXPECT_ERROR_MENTIONS(writer->Commit(second), fault + "committing (SIGBUS");
+        std::ofstream(path, std::ios::binary | std::ios::trunc) << committed;
+    }
+    auto reader = OpenScratch(dir.Path(), OpenMode::ReadOnly);
+    EXPECT_EQ(reader->NextIdentity(), 6000u);
+    EXPECT_EQ(reader->Load(2000)->bytes, first.writes[0].second.bytes);
 }
 
 // Two more ways in which LMDB meets a damaged page, confined the same way: a
@@ -863,11 +876,12 @@ TEST(LmdbStorePageFaults, NullPointersAndAssertionsOfLmdbAreConfinedToAnError) {
     }
 }
 
-// LMDB frees as many pages as the first header of an image's overflow run
-// says when the image is replaced or deleted: a writer refuses to do so with
-// a damaged count (which would hand pages in use to later writes, or append
-// billions of page numbers to the free list). Readers do not use the count.
-TEST(LmdbStorePageFaults, AWriterFreesNoOverflowRunWithADamagedCount) {
+// A writer trusts pages that no read checks: a page's flags, the page count
+// of an overflow run it frees, the free-page lists. Damage there, which
+// readers do not notice, would have it write over pages in use. So before
+// its first change a writer walks every page, and with damage found it takes
+// no change at all; its reads go on.
+TEST(LmdbStorePageFaults, AWriterWalksThePagesBeforeItsFirstChange) {
     TempDir dir;
     const std::string original = dir.Sub("original");
     {
@@ -877,37 +891,40 @@ TEST(LmdbStorePageFaults, AWriterFreesNoOverflowRunWithADamagedCount) {
         }
         OpenScratch(original, OpenMode::CreateIfMissing)->Commit(batch);
     }
-    const uint64 run = [&] {
-        DataFile file(original + "/data.mdb");
-        const uint64 leaf = file.Root("images");
-        return file.Overflow(leaf, file.Nodes(leaf).at(3));
-    }();
-    const uint64 pages = DataFile(original + "/data.mdb").RunPages(run);
+    DataFile file(original + "/data.mdb");
+    const uint64 leaf = file.Root("images");
+    const uint64 run = file.Overflow(leaf, file.Nodes(leaf).at(3));
+    const uint64 pages = file.RunPages(run);
     ASSERT_EQ(pages, 5u);  // the 20 KiB record on 4 KiB pages
+    const struct {
+        std::function<void(DataFile&)> damage;
+        std::string error;
+    } cases[] = {
+        {[&](DataFile& f) { f.SetRunPages(run, pages - 1); }, "has a damaged header"},
+        {[&](DataFile& f) { f.SetRunPages(run, pages | 0x57000000); }, "has a damaged header"},
+        {[&](DataFile& f) { f.SetFlags(leaf, 0xe002); }, "has flags 0xe002 where a leaf page"},
+    };
     const std::string copy = dir.Sub("copy");
-    for (const uint64 count : {pages - 1, pages | 0x57000000}) {
-        SCOPED_TRACE(count);
-        for (const bool replace : {true, false}) {
-            CopyStore(original, copy);
-            DataFile file(copy + "/data.mdb");
-            file.SetRunPages(run, count);
-            file.Write();
-            CommitBatch batch;
-            if (replace) {
-                batch.writes.emplace_back(4, MakeImage(8, 4, 10));
-            } else {
-                batch.deletes.push_back(4);
-            }
-            batch.nextIdentity = 9;
-            EXPECT_ERROR_MENTIONS(OpenScratch(copy, OpenMode::MustExist)->Commit(batch),
-                                  std::string("damaged store: commit: ") +
-                                      (replace ? "writing" : "deleting") +
-                                      " image #4: the header of its overflow pages is damaged");
-            auto reader = OpenScratch(copy, OpenMode::ReadOnly);
-            EXPECT_EQ(reader->NextIdentity(), 1u);
-            EXPECT_EQ(reader->Load(4)->bytes, MakeImage(7, 4, 20000).bytes);
-        }
-        EXPECT_ERROR_MENTIONS(CheckLmdbPages(copy), "has a damaged header");
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.error);
+        CopyStore(original, copy);
+        DataFile damaged(copy + "/data.mdb");
+        c.damage(damaged);
+        damaged.Write();
+        CommitBatch batch;
+        batch.writes.emplace_back(4, MakeImage(8, 4, 10));
+        batch.deletes.push_back(3);
+        batch.nextIdentity = 9;
+        EXPECT_EQ(OpenScratch(copy, OpenMode::ReadOnly)->Load(4)->bytes,
+                  MakeImage(7, 4, 20000).bytes);
+        auto writer = OpenScratch(copy, OpenMode::MustExist);
+        const std::string refused = "data.mdb is damaged: page " + std::to_string(leaf);
+        EXPECT_ERROR_MENTIONS(writer->Commit(batch), refused);
+        EXPECT_ERROR_MENTIONS(writer->Commit(batch), c.error);
+        EXPECT_ERROR_MENTIONS(writer->Commit(CommitBatch{}), "the store takes no more changes");
+        EXPECT_EQ(writer->Load(4)->bytes, MakeImage(7, 4, 20000).bytes);
+        writer.reset();
+        EXPECT_EQ(OpenScratch(copy, OpenMode::ReadOnly)->NextIdentity(), 1u);
     }
 }
 

@@ -212,17 +212,6 @@ void InstallFaultHandler() {
 // positive).
 constexpr int kPastTheMap = -1;
 
-// Returned for an image whose run of overflow pages has a damaged header.
-constexpr int kDamagedRun = -2;
-
-// LMDB 0.9's page header: page number 8, pad 2, flags 2, then (an overflow
-// page) the number of pages in the run, 4.
-constexpr std::size_t kPageHeaderBytes = 16;
-constexpr std::size_t kPageFlagsOffset = 10;
-constexpr std::size_t kRunPagesOffset = 12;
-constexpr uint64 kOverflowPage = 0x04;
-constexpr uint64 kDirtyPage = 0x10;
-
 // A key or value is read one byte in this many while the guard is up.
 constexpr std::size_t kTouchStride = 4096;
 
@@ -540,34 +529,6 @@ int LmdbStore::Touch(const MDB_val& val) const noexcept {
     return MDB_SUCCESS;
 }
 
-// Checks the header of the run of overflow pages that holds `old`, a record
-// that the write transaction is about to replace or delete, against the
-// commit's `pages`. LMDB frees as many pages as that header says without
-// looking further: a damaged count would hand pages still in use to later
-// writes (or, reaching past the file, append billions of page numbers to its
-// free list). A record on a page of the map's that is not the first of an
-// overflow run (pointer minus the header not on a page boundary) lies in its
-// leaf, and one outside the map in a page this transaction wrote: neither
-// has a run to check. Only the records a commit replaces or deletes are
-// checked here; CheckLmdbPages checks every run.
-int LmdbStore::CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept {
-    const auto at = reinterpret_cast<std::uintptr_t>(old.mv_data);
-    if (at < m_mapBegin + kPageHeaderBytes || at >= m_mapEnd ||
-        (at - kPageHeaderBytes - m_mapBegin) % m_pageSize != 0) {
-        return MDB_SUCCESS;
-    }
-    const auto* header = reinterpret_cast<const octet_t*>(at - kPageHeaderBytes);
-    const uint64 page = (at - kPageHeaderBytes - m_mapBegin) / m_pageSize;
-    const uint64 run = GetLe(header + kRunPagesOffset, 4);
-    const uint64 needed = (kPageHeaderBytes - 1 + old.mv_size) / m_pageSize + 1;
-    if (GetLe(header, 8) != page ||
-        (GetLe(header + kPageFlagsOffset, 2) & ~kDirtyPage) != kOverflowPage || run < needed ||
-        run > pages - std::min(page, pages)) {
-        return kDamagedRun;
-    }
-    return MDB_SUCCESS;
-}
-
 // After a fault under a guard: LMDB's state inside the environment cannot be
 // trusted any more, so the store is poisoned: this call and every later one
 // throw the same error. What can be aborted is aborted as the error unwinds
@@ -596,6 +557,31 @@ void LmdbStore::PageFault(const char* doing, const LmdbPageGuard& guard) {
                      "; data.mdb has " + fileBytes + " bytes)";
     }
     throw RuntimeError(m_poisoned);
+}
+
+// Before the writer's first change, every page is walked (CheckLmdbPages),
+// once per opening. Readers meet damage where they read it, but a writer
+// acts on pages it does not read as a reader would and trusts them: a page's
+// flags, the page counts of the overflow runs it frees, the free-page lists
+// it takes pages from. Damage there would have it write over pages in use
+// and spread the damage to a store that read well before. The walk costs
+// what the file holds, paid by a writer that writes, not by an opening;
+// when it finds damage, this and every later change is refused with its
+// error (reads go on).
+void LmdbStore::WritablePages() {
+    if (m_pagesChecked) {
+        return;
+    }
+    if (m_unwritable.empty()) {
+        try {
+            CheckLmdbPages(m_dir);
+            m_pagesChecked = true;
+            return;
+        } catch (const RuntimeError& e) {
+            m_unwritable = std::string(e.what()) + "; the store takes no more changes";
+        }
+    }
+    throw RuntimeError(m_unwritable);
 }
 
 void LmdbStore::ThrowIfPoisoned() const {
@@ -879,8 +865,10 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
         std::vector<std::string> oldKeys;
         state = ReadState(txn, &found, &oldKeys);
         if (found == kFormat1) {
-            // The upgrade: the image bytes counted once, the meta values
-            // moved into the meta record, all in this transaction.
+            // The upgrade: the pages checked (see WritablePages), the image
+            // bytes counted once, the meta values moved into the meta
+            // record, all in this transaction.
+            WritablePages();
             state.imageBytes = SumImageBytes(txn);
             state.imageBytesKnown = true;
             for (const std::string& old : oldKeys) {
@@ -1255,6 +1243,7 @@ void LmdbStore::Commit(const CommitBatch& batch) {
     }
     std::lock_guard lock(m_mutex);
     ThrowIfPoisoned();
+    WritablePages();
     // The new meta values are made in a copy, which replaces the store's
     // once the transaction has committed: a failed commit leaves them as
     // they were.
@@ -1264,10 +1253,6 @@ void LmdbStore::Commit(const CommitBatch& batch) {
     // store has no image for is not an error.
     WriteTransaction([&](MDB_txn* txn) {
         next = *m_state;  // afresh whenever the transaction is run again
-        // The pages of the latest commit, which this transaction builds on.
-        MDB_envinfo info;
-        CheckGuarded("committing", [&]() noexcept { return mdb_env_info(m_env, &info); });
-        const uint64 pages = static_cast<uint64>(info.me_last_pgno) + 1;
         // The image bytes follow every change: the size of a record replaced
         // or deleted is looked up first. That is one more descent of the tree
         // per image, through the pages the write or the deletion then
@@ -1281,9 +1266,8 @@ void LmdbStore::Commit(const CommitBatch& batch) {
             int found = MDB_NOTFOUND;
             const int rc = Guarded("committing", [&]() noexcept {
                 found = mdb_get(txn, m_images, &key, &old);
-                const int run = found == MDB_SUCCESS ? CheckOverflowRun(old, pages) : MDB_SUCCESS;
-                if ((found != MDB_SUCCESS && found != MDB_NOTFOUND) || run != MDB_SUCCESS) {
-                    return found != MDB_SUCCESS ? found : run;
+                if (found != MDB_SUCCESS && found != MDB_NOTFOUND) {
+                    return found;
                 }
                 return mdb_put(txn, m_images, &key, &value, MDB_RESERVE);
             });
@@ -1302,10 +1286,7 @@ void LmdbStore::Commit(const CommitBatch& batch) {
             MDB_val old;
             const int rc = Guarded("committing", [&]() noexcept {
                 const int found = mdb_get(txn, m_images, &key, &old);
-                const int run = found == MDB_SUCCESS ? CheckOverflowRun(old, pages) : MDB_SUCCESS;
-                return found != MDB_SUCCESS ? found
-                       : run != MDB_SUCCESS ? run
-                                            : mdb_del(txn, m_images, &key, nullptr);
+                return found != MDB_SUCCESS ? found : mdb_del(txn, m_images, &key, nullptr);
             });
             if (rc == MDB_NOTFOUND) {
                 continue;
@@ -1460,11 +1441,10 @@ void LmdbStore::Check(int rc, std::string_view doing) {
         throw MapFull{};
     }
     if (rc == MDB_PAGE_NOTFOUND || rc == MDB_CORRUPTED || rc == MDB_CURSOR_FULL ||
-        rc == kPastTheMap || rc == kDamagedRun) {
+        rc == kPastTheMap) {
         m_poisoned = "LMDB store '" + m_dir + "': damaged store: " + std::string(doing) + ": " +
-                     (rc == kPastTheMap   ? "LMDB places a key or value past the end of its map"
-                      : rc == kDamagedRun ? "the header of its overflow pages is damaged"
-                                          : mdb_strerror(rc));
+                     (rc == kPastTheMap ? "LMDB places a key or value past the end of its map"
+                                        : mdb_strerror(rc));
         throw RuntimeError(m_poisoned);
     }
     Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)));

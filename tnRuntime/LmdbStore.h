@@ -41,10 +41,11 @@
 // identity counter, "root:<name>" -> an identity, "counter:<name>" -> a value
 // (8 bytes each), and no image bytes. A ReadOnly opener reads such a store as
 // it is and counts the image bytes when Stats asks. The first writable opener
-// upgrades it in place in one write transaction: it counts the image bytes
-// (one walk of the images' leaves), writes the record and removes the old
-// keys, so that a crash leaves one format or the other; Repairs() reports the
-// upgrade and FormatVersion() the version found.
+// upgrades it in place in one write transaction: it walks the pages (as
+// before any first change, see Faults below), counts the image bytes (one
+// walk of the images' leaves), writes the record and removes the old keys, so
+// that a crash leaves one format or the other; Repairs() reports the upgrade
+// and FormatVersion() the version found.
 //
 // Decisions:
 // - Atomicity: a Commit is one LMDB write transaction (images written, images
@@ -106,12 +107,16 @@
 //   process-wide handler for both signals, chained to the one before it),
 //   arrive as a RuntimeError "damaged store: ..." and poison the store: every
 //   later call throws the same error and nothing more is committed. A writer
-//   checks the header of each run of overflow pages it is about to free. A page
-//   that is sound in itself but wrong can still give a wrong answer (most often
-//   an image not found). CheckLmdbPages walks every page, for whole-store
-//   validation and backups; a compacting CopyTo runs it itself. A write failed
-//   for a full disk says "no space left on device". Misuse by the caller
-//   (writing identity 0, committing to a read-only store) asserts.
+//   trusts pages no read checks (page flags, the page counts of the overflow
+//   runs it frees, the free-page lists), so before its first change after
+//   opening it walks every page with CheckLmdbPages, and a store found damaged
+//   then takes no change (its reads go on): a writer that writes pays for the
+//   walk, an opening does not. A page that is sound in itself but wrong can
+//   still give a wrong answer (most often an image not found). CheckLmdbPages
+//   walks every page, for whole-store validation and backups; a compacting
+//   CopyTo runs it itself. A write failed for a full disk says "no space left
+//   on device". Misuse by the caller (writing identity 0, committing to a
+//   read-only store) asserts.
 
 #include <cstddef>
 #include <cstdint>
@@ -221,10 +226,10 @@ private:
     template <class Call>
     void CheckGuarded(const char* doing, Call&& call);
     int Touch(const MDB_val& val) const noexcept;
-    int CheckOverflowRun(const MDB_val& old, uint64 pages) const noexcept;
     int Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value, const char* doing);
     [[noreturn]] void PageFault(const char* doing, const LmdbPageGuard& guard);
     void ThrowIfPoisoned() const;
+    void WritablePages();
 
     [[noreturn]] void Fail(const std::string& what) const;
     void Check(int rc, std::string_view doing);
@@ -242,6 +247,10 @@ private:
     std::size_t m_pageSize = 0;
     // Once LMDB met a damaged page: the error every call throws.
     std::string m_poisoned;
+    // A writer's walk of the pages before its first change: done, or the
+    // damage it found.
+    bool m_pagesChecked = false;
+    std::string m_unwritable;
     // A writer's reader: a reset read transaction, renewed per read. A
     // ReadOnly store's snapshot: one read transaction for its lifetime.
     MDB_txn* m_reader = nullptr;
