@@ -178,12 +178,13 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
     std::vector<Case> cases = {
         {{},
          2,
-         "a command is needed: record, show, export, diff, backup, sites, merge, dump, validate, "
+         "a command is needed: record, show, export, diff, backup, sites, merge, compact, dump, "
+         "validate, "
          "stats or clear" +
              help},
         {{"frobnicate"},
          2,
-         "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, "
+         "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, compact, "
          "dump, validate, "
          "stats or"},
         {{"--bogus", "show"}, 2, "unknown option '--bogus': options follow the command" + help},

@@ -186,6 +186,25 @@ public:
     // unguarded). Runs beside the writer; a copy holds one commit, whatever
     // the writer commits meanwhile.
     void CopyTo(const std::string& dir, bool compact);
+    // Writers: rewrites data.mdb without its free pages (LMDB's compacting
+    // copy, after a walk of every page) and puts the copy in its place, when
+    // no other process has the store open. Returns false, changing nothing,
+    // when another process (a reader) has it open: the file it has mapped
+    // must stay as it is. The swap is a rename, so a crash leaves one file or
+    // the other, each a whole store.
+    //
+    // How others are kept out: LMDB's openers take a lock on the first byte
+    // of lock.mdb, exclusively if they can (then they are alone and set the
+    // lock file up), shared otherwise, and hold it while the store is open.
+    // With its own environment closed, the writer takes that lock exclusively
+    // (refused while any other process holds it), renames the copy into
+    // place and opens the new file, which LMDB then finds alone and sets up
+    // afresh. The descriptor of that lock stays open for the store's life: a
+    // process's locks on a file go with any descriptor of it that closes.
+    // An opener that opened the old data.mdb just before the rename and then
+    // waited for the lock sees one of the old file's two last commits: a
+    // consistent, older snapshot, never a mix.
+    bool Compact();
     // The bytes of the data file that the latest commit uses, or (when
     // `withoutFreePages`) about what a compacting copy of it takes.
     uint64 DataBytes(bool withoutFreePages = false);
@@ -239,6 +258,7 @@ private:
     LmdbStoreOptions m_options;
     bool m_readOnly = false;
     int m_dirFd = -1;                         // holds a writer's flock
+    int m_compactLockFd = -1;                 // lock.mdb, kept open after a compaction
     bool m_registered = false;                // the directory is entered as open in this process
     std::pair<uint64, uint64> m_dirId{0, 0};  // the directory's device and inode
     MDB_env* m_env = nullptr;

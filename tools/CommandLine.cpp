@@ -29,7 +29,7 @@ constexpr uint64 kMaxJournalMiB = uint64{1} << 20;
 constexpr uint64 kMaxLimit = INT64_MAX;
 
 const char* kCommands =
-    "record, show, export, diff, backup, sites, merge, dump, validate, stats or clear";
+    "record, show, export, diff, backup, sites, merge, compact, dump, validate, stats or clear";
 
 const char* kOpsHelp =
     "operations to record, one a line: site,t,oid,path,offset (site a Guid "
@@ -308,6 +308,10 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
                  "a durable point after every K merged operations (1 to " +
                      std::to_string(kMaxCommitEvery) + ", default 10000)");
     merge.Flag("--no-sync", "do not sync durable points to disk (scratch stores)");
+    Command compact(app, "compact",
+                    "rewrite the data file without its free pages (no other process may have "
+                    "the store open)");
+    compact.Option("--store", "DIR", "store directory");
     Command dump(app, "dump", "print the map's tree, node by node");
     Command validate(app, "validate",
                      "check the tree and the store; exit status 0 only when all holds");
@@ -341,7 +345,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
             throw UsageError{std::string("a command is needed: ") + kCommands, ""};
         }
         for (const Command* cmd : {&record, &show, &exportCmd, &diff, &backup, &sites, &merge,
-                                   &dump, &validate, &stats, &clear}) {
+                                   &compact, &dump, &validate, &stats, &clear}) {
             if (*cmd) {
                 cmd->RefuseExtras();
             }
@@ -443,6 +447,9 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
                 static_cast<int64>(merge.Number("--commit-every", 1, kMaxCommitEvery, 10000));
             cmd.sync = !merge.Flagged("--no-sync");
             return RunMerge(cmd, out, err);
+        }
+        if (compact) {
+            return RunCompact(compact.Store(), out, err);
         }
         if (dump) {
             return RunDump(dump.Store(), out, err);

@@ -134,6 +134,10 @@ int RunMerge(const MergeCommand& cmd, std::ostream& out, std::ostream& err);
 // Counts of the store, its journal and the tree.
 int RunStats(const std::string& store, std::ostream& out, std::ostream& err);
 
+// Rewrites the data file without its free pages, when no other process has
+// the store open (status 1 otherwise, nothing changed).
+int RunCompact(const std::string& store, std::ostream& out, std::ostream& err);
+
 // Removes every field's table and closes the store (a checkpoint).
 int RunClear(const std::string& store, std::ostream& out, std::ostream& err);
 

@@ -1,0 +1,34 @@
+// offsetops compact: the data file rewritten without its free pages.
+
+#include <cstdio>
+
+#include "tools/CommandSupport.h"
+#include "tools/Commands.h"
+
+namespace tarn::tool {
+
+namespace {
+
+std::string MiBText(int64 bytes) {
+    char text[32];
+    std::snprintf(text, sizeof text, "%.1f MiB", static_cast<double>(bytes) / (1024.0 * 1024.0));
+    return text;
+}
+
+}  // namespace
+
+int RunCompact(const std::string& store, std::ostream& out, std::ostream& err) {
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::WriteExisting, err);
+    const CompactResult result = opened.Compact();
+    opened.Close();
+    if (!result.compacted) {
+        return Fail(err, "store '" + store +
+                             "' was not compacted: another process has it open (a reader); "
+                             "try again when it has closed");
+    }
+    out << "compacted '" << store << "': " << MiBText(result.bytesBefore) << " -> "
+        << MiBText(result.bytesAfter) << '\n';
+    return 0;
+}
+
+}  // namespace tarn::tool
