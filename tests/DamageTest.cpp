@@ -601,6 +601,32 @@ TEST(FullDisk, RecordingAndBackupsStopWithNoSpaceLeftAndGoOnOnceThereIsRoom) {
     EXPECT_EQ(Shown(copy), texts.at(kFillOps));
 }
 
+// A store on a read-only mount: every reader works (without a slot in
+// LMDB's lock file, which it may not write), and a writer is refused with one
+// line.
+TEST(ReadOnlyStore, ReadersWorkOnAReadOnlyMount) {
+    ScratchDir dir;
+    const std::string mount = dir.Sub("ro");
+    SmallDisk disk(mount);
+    if (!disk.Mounted()) {
+        GTEST_SKIP() << "cannot mount a tmpfs here: " << disk.Error();
+    }
+    const std::string store = mount + "/store";
+    RunOk({"record", "--store", store, "--generate", "3000", "--fields", "500"});
+    const std::string shown = Shown(store);
+    ASSERT_EQ(::mount("tmpfs", mount.c_str(), "tmpfs", MS_REMOUNT | MS_RDONLY, "size=4m"), 0)
+        << std::strerror(errno);
+    EXPECT_EQ(Shown(store), shown);
+    for (const char* command : {"validate", "stats", "export", "sites"}) {
+        const ToolRun run = Tool({command, "--store", store});
+        EXPECT_EQ(run.status, 0) << command << ": " << run.err;
+    }
+    const ToolRun writer = Tool({"record", "--store", store, "--generate", "5"});
+    EXPECT_EQ(writer.status, 1);
+    EXPECT_TRUE(IsOneErrorLine(writer.err)) << writer.err;
+    EXPECT_EQ(Shown(store), shown);
+}
+
 }  // namespace
 }  // namespace tarn::testing
 

@@ -638,6 +638,21 @@ int LmdbStore::Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value,
     });
 }
 
+namespace {
+
+// Whether this process may write the lock file (or make it, when there is
+// none): not on a read-only mount, nor in a directory of another user's that
+// it may only read.
+bool LockFileWritable(const std::string& dir) {
+    const std::string lock = dir + "/lock.mdb";
+    if (::access(lock.c_str(), F_OK) == 0) {
+        return ::access(lock.c_str(), W_OK) == 0;
+    }
+    return ::access(dir.c_str(), W_OK) == 0;
+}
+
+}  // namespace
+
 std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir, OpenMode mode) {
     LmdbStoreOptions options;
     options.mode = mode;
@@ -653,8 +668,13 @@ std::unique_ptr<LmdbStore> LmdbStore::Open(const std::string& dir,
     // LMDB maps the files it is given: a short or damaged one is caught first.
     const bool writer = options.mode != OpenMode::ReadOnly;
     CheckLmdbDataFile(dir, writer);
-    if (std::optional<std::string> repair = CheckLmdbLockFile(dir, writer)) {
-        store->m_repairs.push_back(std::move(*repair));
+    // A reader of a store it may not write (another user's, a read-only
+    // mount) cannot take a slot in LMDB's lock file: it reads without one.
+    store->m_withoutLock = !writer && !LockFileWritable(dir);
+    if (!store->m_withoutLock) {
+        if (std::optional<std::string> repair = CheckLmdbLockFile(dir, writer)) {
+            store->m_repairs.push_back(std::move(*repair));
+        }
     }
     store->OpenEnvironment();
     store->OpenDatabases(options.mode);
@@ -736,6 +756,9 @@ void LmdbStore::OpenEnvironment() {
     unsigned int flags = MDB_NOTLS;
     if (m_readOnly) {
         flags |= MDB_RDONLY;
+    }
+    if (m_withoutLock) {
+        flags |= MDB_NOLOCK;
     }
     if (!m_options.syncOnCommit) {
         flags |= MDB_NOSYNC;

@@ -87,6 +87,16 @@
 //   it again to see newer commits. While it is open the writer cannot reuse
 //   the pages of that commit, so the file grows faster: keep readers short.
 //   A writable store reads the latest commit, its own, at every call.
+// - Stores this process may not write: a ReadOnly opener that cannot write
+//   lock.mdb (a read-only mount, another user's store it may only read)
+//   opens without LMDB's lock (MDB_NOLOCK) and takes no reader slot. Alone,
+//   or beside other readers, that changes nothing. Beside a writer it does:
+//   the writer does not know of the snapshot, and may reuse its pages two
+//   commits later. Every image is checked against its checksum and identity
+//   and the meta record against its own, so such a reader then meets an
+//   error ("damaged store" or a checksum mismatch), not a wrong table; open
+//   it again for a newer snapshot. Compact() cannot see such a reader
+//   either: the file it mapped stays whole (the swap is a rename).
 // - Threads: every member may be called from any thread; calls are serialised
 //   by an internal mutex. A store must not be used in a child after fork().
 // - Faults: a missing directory (when it must exist), a directory that is not a
@@ -205,6 +215,8 @@ public:
     // waited for the lock sees one of the old file's two last commits: a
     // consistent, older snapshot, never a mix.
     bool Compact();
+    // A reader that opened without a slot in LMDB's lock file (see Open).
+    bool WithoutLock() const { return m_withoutLock; }
     // The bytes of the data file that the latest commit uses, or (when
     // `withoutFreePages`) about what a compacting copy of it takes.
     uint64 DataBytes(bool withoutFreePages = false);
@@ -259,6 +271,7 @@ private:
     bool m_readOnly = false;
     int m_dirFd = -1;                         // holds a writer's flock
     int m_compactLockFd = -1;                 // lock.mdb, kept open after a compaction
+    bool m_withoutLock = false;               // a reader that may not write lock.mdb
     bool m_registered = false;                // the directory is entered as open in this process
     std::pair<uint64, uint64> m_dirId{0, 0};  // the directory's device and inode
     MDB_env* m_env = nullptr;
