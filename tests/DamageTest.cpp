@@ -349,6 +349,12 @@ void RunDamageCampaign(const std::function<std::optional<uint64>()>& nextSeed) {
                 std::vector<std::string> args{command, "--store", copy};
                 if (command == "record") {
                     args.insert(args.end(), {"--ops", laterOps});
+                    // Every other copy is recorded into within a bound,
+                    // which sends changed nodes through the writer's own
+                    // file.
+                    if ((&damage - damages.data()) % 2 == 1) {
+                        args.insert(args.end(), {"--cache-nodes", "16"});
+                    }
                 } else if (command == "backup") {
                     args.insert(args.end(), {"--to", backup});
                 }
