@@ -7,6 +7,7 @@
 #include <setjmp.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
@@ -38,6 +39,13 @@
 namespace tarn {
 
 static_assert(std::is_same_v<MDB_dbi, unsigned int>, "database handles are kept as unsigned int");
+
+namespace {
+
+// Loads between two releases of the map's touched pages (ReleaseMappedPages).
+constexpr uint64 kLoadsPerRelease = 4096;
+
+}  // namespace
 
 namespace {
 
@@ -1142,9 +1150,27 @@ std::optional<StoredImage> LmdbStore::Load(uint64 oid) {
         Check(rc, "reading image " + OidText(oid));
     }
     try {
-        return DecodeImageRecord(oid, Bytes(value));
+        std::optional<StoredImage> image = DecodeImageRecord(oid, Bytes(value));
+        if (++m_loadsSinceRelease == kLoadsPerRelease) {
+            ReleaseMappedPages();
+        }
+        return image;
     } catch (const RuntimeError& e) {
         Fail(e.what());
+    }
+}
+
+// LMDB reads the file through its map, and every page a process touched
+// counts in its resident memory until the kernel reclaims it, although it is
+// only the page cache: a walk of a large store would look like a store held
+// in memory, and a memory bound on the tree would not show in the process's
+// size. So the pages are let go of (MADV_DONTNEED on the read-only shared
+// map: the next touch finds them in the page cache again) after every
+// commit, after a compaction and every kLoadsPerRelease loads.
+void LmdbStore::ReleaseMappedPages() {
+    m_loadsSinceRelease = 0;
+    if (m_mapBegin != 0 && m_mapEnd > m_mapBegin) {
+        (void)::madvise(reinterpret_cast<void*>(m_mapBegin), m_mapEnd - m_mapBegin, MADV_DONTNEED);
     }
 }
 
@@ -1317,6 +1343,7 @@ bool LmdbStore::Compact() {
         m_compactLockFd = lockFd.Release();
         m_pagesChecked = true;  // the copy was made from pages walked just now
     }
+    ReleaseMappedPages();
     return alone;
 }
 
@@ -1407,6 +1434,7 @@ void LmdbStore::Commit(const CommitBatch& batch) {
         WriteState(txn, next);
     });
     *m_state = std::move(next);
+    ReleaseMappedPages();
 }
 
 void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {

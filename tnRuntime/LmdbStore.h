@@ -252,6 +252,8 @@ private:
     template <class Apply>
     void WriteTransaction(Apply&& apply);
     void GrowMap();
+    // Lets go of the map's pages this process has touched (see the .cpp).
+    void ReleaseMappedPages();
     MDB_txn* BeginRead();
     template <class Call>
     int Guarded(const char* doing, Call&& call);
@@ -278,6 +280,7 @@ private:
     // Where data.mdb is mapped (0, 0: not known), for the page guards.
     std::uintptr_t m_mapBegin = 0;
     std::uintptr_t m_mapEnd = 0;
+    uint64 m_loadsSinceRelease = 0;
     std::size_t m_pageSize = 0;
     // Once LMDB met a damaged page: the error every call throws.
     std::string m_poisoned;
