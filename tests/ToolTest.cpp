@@ -76,7 +76,7 @@ TEST(OpsFileParsing, ReadsFieldsAroundBlanksAndCommentsAndSaysWhatIsWrongWithALi
                     HasSubstr(expected))
             << line;
     }
-    EXPECT_EQ(ToString(*tool::ParseFieldId("12", nullptr)), "#12/");
+    EXPECT_EQ(ToString(*ParseFieldId("12", nullptr)), "#12/");
 }
 
 // ---------------------------------------------------------------------------

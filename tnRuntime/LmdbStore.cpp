@@ -50,8 +50,9 @@ constexpr std::size_t kIdentityChunk = 1024;
 // aborted, the map grown and the transaction run again.
 struct MapFull {};
 
-[[noreturn]] void FailAt(const std::string& dir, const std::string& what) {
-    throw RuntimeError("LMDB store '" + dir + "': " + what);
+[[noreturn]] void FailAt(const std::string& dir, const std::string& what,
+                         RuntimeError::Category category = RuntimeError::Category::Other) {
+    throw RuntimeError(category, "LMDB store '" + dir + "': " + what);
 }
 
 MDB_val Val(const void* data, std::size_t size) {
@@ -120,7 +121,7 @@ void PrepareDirectory(const std::string& dir, OpenMode mode) {
     const fs::file_status status = fs::status(dir, ec);
     if (status.type() == fs::file_type::not_found) {
         if (mode != OpenMode::CreateIfMissing) {
-            FailAt(dir, "directory does not exist");
+            FailAt(dir, "directory does not exist", RuntimeError::Category::NotFound);
         }
         fs::create_directories(dir, ec);
         if (ec) {
@@ -265,7 +266,8 @@ void LmdbStore::LockDirectory() {
             g_openDirsPid = ::getpid();
         }
         if (!g_openDirs.insert(m_dirId).second) {
-            Fail("in use: the store is already open in this process");
+            Fail("in use: the store is already open in this process",
+                 RuntimeError::Category::InUse);
         }
         m_registered = true;
     }
@@ -274,7 +276,8 @@ void LmdbStore::LockDirectory() {
     }
     if (::flock(m_dirFd, LOCK_EX | LOCK_NB) != 0) {
         if (errno == EWOULDBLOCK) {
-            Fail("in use: another writer (in this or another process) holds the store");
+            Fail("in use: another writer (in this or another process) holds the store",
+                 RuntimeError::Category::InUse);
         }
         Fail(std::string("cannot lock the directory: ") + std::strerror(errno));
     }
@@ -317,7 +320,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             CheckFormat(txn);
             const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
             if (rcImages == MDB_NOTFOUND) {
-                Fail("damaged store: the \"images\" database is missing");
+                Fail("damaged store: the \"images\" database is missing",
+                     RuntimeError::Category::Damaged);
             }
             Check(rcImages, "opening the images database");
         } catch (...) {
@@ -363,7 +367,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
         CheckFormat(txn);
         const int rcImages = mdb_dbi_open(txn, kImagesDb, 0, &m_images);
         if (rcImages == MDB_NOTFOUND) {
-            Fail("damaged store: the \"images\" database is missing");
+            Fail("damaged store: the \"images\" database is missing",
+                 RuntimeError::Category::Damaged);
         }
         Check(rcImages, "opening the images database");
     });
@@ -492,7 +497,8 @@ uint64 LmdbStore::ReadMeta64(MDB_txn* txn, std::string_view key, bool* found) {
     }
     if (value.mv_size != 8) {
         Fail("damaged store: meta entry '" + std::string(key) + "' has " +
-             std::to_string(value.mv_size) + " bytes, expected 8");
+                 std::to_string(value.mv_size) + " bytes, expected 8",
+             RuntimeError::Category::Damaged);
     }
     return FromLe64(value);
 }
@@ -545,7 +551,8 @@ std::map<std::string, uint64> LmdbStore::Roots() {
         }
         if (value.mv_size != 8) {
             Fail("damaged store: meta entry '" + std::string(name) + "' has " +
-                 std::to_string(value.mv_size) + " bytes, expected 8");
+                     std::to_string(value.mv_size) + " bytes, expected 8",
+                 RuntimeError::Category::Damaged);
         }
         roots.emplace(name.substr(kRootPrefix.size()), FromLe64(value));
     }
@@ -572,7 +579,8 @@ std::map<std::string, uint64> LmdbStore::Counters() {
         }
         if (value.mv_size != 8) {
             Fail("damaged store: meta entry '" + std::string(name) + "' has " +
-                 std::to_string(value.mv_size) + " bytes, expected 8");
+                     std::to_string(value.mv_size) + " bytes, expected 8",
+                 RuntimeError::Category::Damaged);
         }
         counters.emplace(name.substr(kCounterPrefix.size()), FromLe64(value));
     }
@@ -663,7 +671,7 @@ uint64 LmdbStore::NextIdentity() {
     bool found = false;
     const uint64 next = ReadMeta64(read.Txn(), kNextIdentityKey, &found);
     if (!found) {
-        Fail("damaged store: the identity counter is missing");
+        Fail("damaged store: the identity counter is missing", RuntimeError::Category::Damaged);
     }
     return next;
 }
@@ -746,7 +754,8 @@ void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
                  rc = cursor.Get(&key, &value, MDB_NEXT)) {
                 if (key.mv_size != 8) {
                     Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
-                         " bytes, expected 8");
+                             " bytes, expected 8",
+                         RuntimeError::Category::Damaged);
                 }
                 chunk.push_back(IdentityOfKey(key));
             }
@@ -778,8 +787,9 @@ std::optional<uint64> LmdbStore::LargestIdentity() {
     }
     Check(rc, "finding the largest identity");
     if (key.mv_size != 8) {
-        Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
-             " bytes, expected 8");
+        Fail(
+            "damaged store: an image key has " + std::to_string(key.mv_size) + " bytes, expected 8",
+            RuntimeError::Category::Damaged);
     }
     return IdentityOfKey(key);
 }
@@ -846,8 +856,8 @@ std::size_t LmdbStore::MapSize() {
     return info.me_mapsize;
 }
 
-void LmdbStore::Fail(const std::string& what) const {
-    FailAt(m_dir, what);
+void LmdbStore::Fail(const std::string& what, RuntimeError::Category category) const {
+    FailAt(m_dir, what, category);
 }
 
 void LmdbStore::Check(int rc, std::string_view doing) const {
@@ -857,7 +867,10 @@ void LmdbStore::Check(int rc, std::string_view doing) const {
     if (rc == MDB_MAP_FULL) {
         throw MapFull{};
     }
-    Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)));
+    Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)),
+         rc == MDB_CORRUPTED || rc == MDB_PAGE_NOTFOUND ? RuntimeError::Category::Damaged
+         : rc > 0                                       ? RuntimeError::CategoryOfErrno(rc)
+                                                        : RuntimeError::Category::Other);
 }
 
 std::unique_ptr<IStore> OpenStore(const std::string& dir, OpenMode mode) {

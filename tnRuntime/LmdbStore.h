@@ -145,7 +145,8 @@ private:
     MDB_txn* BeginRead();
     uint64 ReadMeta64(MDB_txn* txn, std::string_view key, bool* found);
 
-    [[noreturn]] void Fail(const std::string& what) const;
+    [[noreturn]] void Fail(const std::string& what,
+                           RuntimeError::Category category = RuntimeError::Category::Other) const;
     void Check(int rc, std::string_view doing) const;
 
     std::string m_dir;

@@ -61,7 +61,7 @@ std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheO
     }
     // A walk that stops at once loads the path to the first leaf: damage on
     // it is reported before anything is written.
-    store.ForEach([](const FieldId&, const OffsetOpsOnField<int64>&) { return false; });
+    store.ForEach([](const FieldId&, const FieldTable&) { return false; });
     return store;
 }
 

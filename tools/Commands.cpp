@@ -239,17 +239,16 @@ int RunShow(const std::string& store, const ShowQuery& query, std::ostream& out,
     OstreamOutputStream sink(out);
     xostream os(sink);
     if (query.field) {
-        const std::unique_ptr<OffsetOpsOnField<int64>> table = opened.Find(*query.field);
+        const std::optional<FieldTable> table = opened.Find(*query.field);
         if (!table) {
             return Fail(err, "no offsets recorded for field " + ToString(*query.field));
         }
-        os << *query.field << " --> " << *table << '\n';
+        os << *query.field << " --> " << ToString(*table) << '\n';
         return 0;
     }
     int64 shown = 0;
     bool more = false;  // a field in range after the limit
-    const OffsetOpsStore::FieldVisitor print = [&](const FieldId& key,
-                                                   const OffsetOpsOnField<int64>& table) {
+    const OffsetOpsStore::FieldVisitor print = [&](const FieldId& key, const FieldTable& table) {
         if (query.to && CompareKeys(key, *query.to) > 0) {
             return false;
         }
@@ -257,7 +256,7 @@ int RunShow(const std::string& store, const ShowQuery& query, std::ostream& out,
             more = true;
             return false;
         }
-        os << key << " --> " << table << '\n';
+        os << key << " --> " << ToString(table) << '\n';
         ++shown;
         return static_cast<bool>(out);
     };

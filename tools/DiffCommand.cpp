@@ -4,6 +4,7 @@
 #include <filesystem>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
+#include "tnStore/FieldCursor.h"
 #include "tnUtils/OstreamOutputStream.h"
 #include "tnUtils/xostream.h"
 #include "tools/CommandSupport.h"
@@ -16,49 +17,6 @@ namespace {
 
 constexpr int kDiffer = 1;
 constexpr int kTrouble = 2;
-
-// A position in one store's map, walking it in key order; it holds the
-// tables of a few hundred fields at a time.
-class FieldCursor {
-public:
-    explicit FieldCursor(OffsetOpsStore& store) : m_store(store) { Fill(nullptr); }
-
-    bool AtEnd() const { return m_at == m_batch.size(); }
-    const FieldId& Key() const { return m_batch[m_at].first; }
-    const OffsetOpsOnField<int64>& Table() const { return m_batch[m_at].second; }
-
-    void Next() {
-        if (++m_at == m_batch.size() && m_batch.size() == kBatch) {
-            const FieldId last = m_batch.back().first;
-            Fill(&last);
-        }
-    }
-
-private:
-    static constexpr std::size_t kBatch = 512;
-
-    // The next batch: the fields after `after` (from the first, when null).
-    void Fill(const FieldId* after) {
-        m_batch.clear();
-        m_at = 0;
-        m_store.ForEachFrom(after ? *after : FieldId(),
-                            [&](const FieldId& key, const OffsetOpsOnField<int64>& table) {
-                                if (after != nullptr && CompareKeys(key, *after) == 0) {
-                                    return true;
-                                }
-                                // Made empty, then assigned: tables are copied by assignment.
-                                m_batch.emplace_back();
-                                m_batch.back().first = key;
-                                m_batch.back().second = table;
-                                return m_batch.size() < kBatch;
-                            });
-    }
-
-    OffsetOpsStore& m_store;
-    // A deque: its elements never move, and tables are not copy-constructed.
-    std::deque<std::pair<FieldId, OffsetOpsOnField<int64>>> m_batch;
-    std::size_t m_at = 0;
-};
 
 struct DiffCounts {
     int64 onlyA = 0;
@@ -79,18 +37,19 @@ DiffCounts Compare(OffsetOpsStore& a, OffsetOpsStore& b, const WalkSettings& set
     while (!x.AtEnd() || !y.AtEnd()) {
         const int order = x.AtEnd() ? 1 : y.AtEnd() ? -1 : CompareKeys(x.Key(), y.Key());
         if (order < 0) {
-            os << "< " << x.Key() << " --> " << x.Table() << '\n';
+            os << "< " << x.Key() << " --> " << ToString(x.Table()) << '\n';
             ++counts.onlyA;
             x.Next();
             ++walked;
         } else if (order > 0) {
-            os << "> " << y.Key() << " --> " << y.Table() << '\n';
+            os << "> " << y.Key() << " --> " << ToString(y.Table()) << '\n';
             ++counts.onlyB;
             y.Next();
             ++walked;
         } else {
             if (!(x.Table() == y.Table())) {
-                os << "! " << x.Key() << " --> " << x.Table() << ' ' << y.Table() << '\n';
+                os << "! " << x.Key() << " --> " << ToString(x.Table()) << ' '
+                   << ToString(y.Table()) << '\n';
                 ++counts.other;
             }
             x.Next();

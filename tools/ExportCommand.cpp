@@ -93,12 +93,12 @@ int RunExport(const std::string& store, const std::string& outFile, const WalkSe
     ProgressLine progress(settings.progress, err, "export");
     int64 done = 0;
     OffsetOperation op;
-    opened->ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
+    opened->ForEach([&](const FieldId& field, const FieldTable& table) {
         op.field = field;
-        for (const auto& [site, so] : table.m_map.getmap()) {
-            op.site = site;
-            op.t = so.t;
-            op.offset = so.o;
+        for (const SiteRecord& r : table) {
+            op.site = r.site;
+            op.t = r.t;
+            op.offset = r.o;
             sink << FormatOpsLine(op) << '\n';
         }
         ++done;

@@ -54,11 +54,6 @@ struct ParsedLine {
 
 ParsedLine ParseOpsLine(std::string_view line);
 
-// A field key in the text form of FieldId ("#12/0a0b"): an optional '#', the
-// decimal identity, then '/' and the path in hex. "12" alone means the empty
-// path. Nothing, with a message in `error`, when the text is not one.
-std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error);
-
 // Reads operations from a stream line by line, skipping blanks and comments.
 // Not thread-safe; owns nothing but its line buffer.
 class OpsFileReader {

@@ -13,8 +13,8 @@ namespace {
 constexpr int kConflicts = 1;
 constexpr int kTrouble = 2;
 
-std::string RecordText(const SiteOffset<int64>& so) {
-    return "(" + std::to_string(so.t) + "," + std::to_string(so.o) + ")";
+std::string RecordText(const SiteRecord& r) {
+    return ToString(r);
 }
 
 }  // namespace
