@@ -129,9 +129,20 @@ ParsedLine ParseOpsLine(std::string_view line) {
     return parsed;
 }
 
+int64 OpsFileReader::Skip(int64 lines) {
+    int64 skipped = 0;
+    for (; skipped < lines && std::getline(m_in, m_buffer); ++skipped) {
+        ++m_line;
+        m_complete = !m_in.eof();
+        m_bytes += m_buffer.size() + 1;
+    }
+    return skipped;
+}
+
 OpsFileReader::Status OpsFileReader::Next(OffsetOperation& op, std::string& error) {
     while (std::getline(m_in, m_buffer)) {
         ++m_line;
+        m_complete = !m_in.eof();
         m_bytes += m_buffer.size() + 1;
         std::string_view line = m_buffer;
         if (m_line == 1 && line.starts_with(kByteOrderMark)) {

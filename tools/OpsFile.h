@@ -66,6 +66,14 @@ public:
     // line LineNumber(). After End or Error, do not call again.
     Status Next(OffsetOperation& op, std::string& error);
 
+    // Passes over the next `lines` lines, whatever they hold; returns how
+    // many there were (fewer at the end of the input).
+    int64 Skip(int64 lines);
+
+    // Whether the line read last ended in a line break (or was the file's
+    // last line): false for one cut short by the input's end.
+    bool LastLineComplete() const { return m_complete; }
+
     // The number of the line read last (1 for the first line).
     int64 LineNumber() const { return m_line; }
     const std::string& Name() const { return m_name; }
@@ -78,6 +86,7 @@ private:
     std::string m_buffer;
     int64 m_line = 0;
     uint64 m_bytes = 0;
+    bool m_complete = true;
 };
 
 }  // namespace tarn::tool
