@@ -3,6 +3,7 @@
 # API's headers and no internal one, its version file takes this version and
 # refuses another major or minor one, pkg-config finds the library, the
 # embedding example builds (with CMake, and with pkg-config's flags) and runs,
+# the program comes with its man page and completion,
 # and a misuse caught in an installed header names it from the repository
 # root, not by the prefix.
 #   cmake -DBUILD_DIR=... -DSOURCE_DIR=... -DWORK_DIR=... -DCXX=... -DVERSION=... -P InstalledPackage.cmake
@@ -30,6 +31,13 @@ foreach(header tnRuntime/CSpace.h tnStore/StoreImpl.h tnRuntime/LmdbStore.h
                tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h)
     if(EXISTS ${prefix}/include/tarn/${header})
         message(FATAL_ERROR "the internal header ${header} is installed")
+    endif()
+endforeach()
+
+# The program's man page and bash completion.
+foreach(file share/man/man1/offsetops.1 share/bash-completion/completions/offsetops)
+    if(NOT EXISTS ${prefix}/${file})
+        message(FATAL_ERROR "${file} is not installed")
     endif()
 endforeach()
 

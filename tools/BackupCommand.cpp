@@ -42,16 +42,35 @@ int RunBackup(const Arguments& args, Io& io) {
     const fs::path partial =
         (target.has_parent_path() ? target.parent_path() : fs::path(".")) /
         ("." + target.filename().string() + kPartialSuffix + std::to_string(::getpid()));
+    std::error_code ec;
+    const bool targetExisted = fs::exists(target, ec);  // an empty directory
+    auto stopped = [&] {
+        const int signal = StopSignal();
+        io.err << (line.Enabled() ? "\n" : "") << "offsetops: backup stopped by "
+               << SignalName(signal) << "; nothing was written to '" << to << "'" << std::endl;
+        return StoppedStatus(signal);
+    };
     BackupResult result;
     {
         StopWatch watch([&] {
-            std::error_code ec;
-            fs::remove_all(partial, ec);
-            io.err << (line.Enabled() ? "\n" : "") << "offsetops: backup stopped by "
-                   << SignalName(StopSignal()) << "; nothing was written to '" << to << "'"
-                   << std::endl;
+            // The copying thread may add a file as the directory goes: try
+            // again until it is gone.
+            std::error_code ignored;
+            for (int i = 0; i < 100 && fs::exists(partial, ignored); ++i) {
+                fs::remove_all(partial, ignored);
+            }
+            stopped();
         });
         result = OffsetOpsStore::Backup(dir, to, options);
+    }
+    if (StopSignal() != 0) {
+        // Stopped as the copy was renamed into place: this run leaves nothing
+        // behind either way.
+        fs::remove_all(target, ec);
+        if (targetExisted) {
+            fs::create_directory(target, ec);
+        }
+        return stopped();
     }
     line.Finish();
     io.out << "backed up '" << dir << "' to '" << to << "'" << (compact ? " (compacted)" : "")

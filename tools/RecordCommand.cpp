@@ -58,7 +58,8 @@ public:
                     case OpsSource::Status::Operation:
                         break;
                     case OpsSource::Status::End:
-                        return Finished();
+                        // A signal that came as the input ended still stops.
+                        return StopSignal() != 0 ? Stopped(StopSignal()) : Finished();
                     case OpsSource::Status::Stopped:
                         return Stopped(StopSignal());
                     case OpsSource::Status::Error:
