@@ -349,6 +349,12 @@ void RunDamageCampaign(const std::function<std::optional<uint64>()>& nextSeed) {
                 std::vector<std::string> args{command, "--store", copy};
                 if (command == "record") {
                     args.insert(args.end(), {"--ops", laterOps});
+                    // Every other copy is recorded into within a bound,
+                    // which sends changed nodes through the writer's own
+                    // file.
+                    if ((&damage - damages.data()) % 2 == 1) {
+                        args.insert(args.end(), {"--cache-nodes", "16"});
+                    }
                 } else if (command == "backup") {
                     args.insert(args.end(), {"--to", backup});
                 }
@@ -599,6 +605,32 @@ TEST(FullDisk, RecordingAndBackupsStopWithNoSpaceLeftAndGoOnOnceThereIsRoom) {
     fs::remove(disk.Filler());
     RunOk({"backup", "--store", source, "--to", copy});
     EXPECT_EQ(Shown(copy), texts.at(kFillOps));
+}
+
+// A store on a read-only mount: every reader works (without a slot in
+// LMDB's lock file, which it may not write), and a writer is refused with one
+// line.
+TEST(ReadOnlyStore, ReadersWorkOnAReadOnlyMount) {
+    ScratchDir dir;
+    const std::string mount = dir.Sub("ro");
+    SmallDisk disk(mount);
+    if (!disk.Mounted()) {
+        GTEST_SKIP() << "cannot mount a tmpfs here: " << disk.Error();
+    }
+    const std::string store = mount + "/store";
+    RunOk({"record", "--store", store, "--generate", "3000", "--fields", "500"});
+    const std::string shown = Shown(store);
+    ASSERT_EQ(::mount("tmpfs", mount.c_str(), "tmpfs", MS_REMOUNT | MS_RDONLY, "size=4m"), 0)
+        << std::strerror(errno);
+    EXPECT_EQ(Shown(store), shown);
+    for (const char* command : {"validate", "stats", "export", "sites"}) {
+        const ToolRun run = Tool({command, "--store", store});
+        EXPECT_EQ(run.status, 0) << command << ": " << run.err;
+    }
+    const ToolRun writer = Tool({"record", "--store", store, "--generate", "5"});
+    EXPECT_EQ(writer.status, 1);
+    EXPECT_TRUE(IsOneErrorLine(writer.err)) << writer.err;
+    EXPECT_EQ(Shown(store), shown);
 }
 
 }  // namespace

@@ -220,7 +220,7 @@ TEST(ToolCommandLine, VersionHelpAndSuggestionsForNearMisses) {
         {{"valdiate"}, "unknown command 'valdiate': did you mean 'validate'?"},
         {{"frobnicate"},
          "unknown command 'frobnicate': use record, show, export, diff, backup, "
-         "sites, merge, dump, validate, stats or clear (see 'offsetops --help')"},
+         "sites, merge, compact, dump, validate, stats or clear (see 'offsetops --help')"},
         {{"help", "stast"}, "unknown command 'stast': did you mean 'stats'?"},
         {{"show", "--store", "s", "--limt", "3"},
          "unknown option '--limt' for show: did you mean '--limit'? (see 'offsetops show "

@@ -178,12 +178,14 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
     std::vector<Case> cases = {
         {{},
          2,
-         "a command is needed: record, show, export, diff, backup, sites, merge, dump, validate, "
+         "a command is needed: record, show, export, diff, backup, sites, merge, compact, dump, "
+         "validate, "
          "stats or clear" +
              help},
         {{"frobnicate"},
          2,
          "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, "
+         "compact, "
          "dump, validate, "
          "stats or"},
         {{"--bogus", "show"}, 2, "unknown option '--bogus': options follow the command" + help},
@@ -256,9 +258,10 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
          kSiteA + ",4294967295,5,,1\n"},
     };
     for (const char* command : {"show", "dump", "validate", "stats", "clear"}) {
-        cases.push_back({{command, "--store", missing},
-                         1,
-                         "store '" + missing + "' does not exist; 'offsetops record' creates stores"});
+        cases.push_back(
+            {{command, "--store", missing},
+             1,
+             "store '" + missing + "' does not exist; 'offsetops record' creates stores"});
     }
     for (const Case& c : cases) {
         dir.Write("ops.txt", c.kept + c.input);

@@ -196,21 +196,21 @@ struct PageDamage {
     std::string what;
 };
 
-// The B-trees of a meta page, walked page by page before LMDB walks them:
-// LMDB trusts the offsets, sizes, flags and page numbers inside its pages, and
-// one wrong byte there sends it outside the page or the map. Every branch and
-// leaf page is checked (header, free-space bounds, each node within the page,
-// node flags a database of this store may hold, child and overflow page
-// numbers within the file, leaves all at the tree's depth, no page used
-// twice); the overflow pages holding the images are not read. A writer also
-// checks what only it uses: the overflow pages' headers (their page counts go
-// into the free list when an image is replaced) and the newest commit's
-// free-page lists, which must name no page that commit uses (LMDB would write
-// over it).
+// The B-trees of a meta page, walked page by page with plain reads: LMDB
+// trusts the offsets, sizes, flags and page numbers inside its pages, and one
+// wrong byte there sends it to a wrong page, outside the page or outside the
+// map. Every branch and leaf page is checked (header, free-space bounds, each
+// node within the page, node flags a database of this store may hold, child
+// and overflow page numbers within the file, leaves all at the tree's depth,
+// no page used twice); the overflow pages holding the images are not read.
+// Also checked is what only a writer uses: the overflow pages' headers (their
+// page counts go into the free list when an image is replaced) and the newest
+// commit's free-page lists, which must name no page that commit uses (LMDB
+// would write over it).
 class PageWalk {
 public:
-    PageWalk(const File& file, uint64 pageSize, uint64 pages, bool writer)
-        : m_file(file), m_pageSize(pageSize), m_pages(pages), m_writer(writer), m_seen(pages) {}
+    PageWalk(const File& file, uint64 pageSize, uint64 pages)
+        : m_file(file), m_pageSize(pageSize), m_pages(pages), m_seen(pages) {}
 
     // Walks the trees of `meta`: the newest commit's first, then the older.
     void Walk(const Meta& meta, bool newest) {
@@ -218,7 +218,7 @@ public:
             throw PageDamage{"a meta page has database flags LMDB did not write"};
         }
         Tree("main", meta.main, Kind::Main);
-        if (m_writer && newest) {
+        if (newest) {
             Tree("free-page", meta.free, Kind::Free);
             for (const uint64 page : m_listedFree) {
                 if (m_seen[page] != 0) {
@@ -335,7 +335,7 @@ private:
                             std::to_string(first) + " run past the file");
             }
             Overflow(name, pgno, first, count);
-            if (m_writer) {
+            {
                 octet_t header[kPageHeaderBytes];
                 if (!m_file.ReadAt(header, sizeof header, first * m_pageSize) ||
                     GetLe(header, 8) != first ||
@@ -400,8 +400,7 @@ private:
 
     const File& m_file;
     uint64 m_pageSize;
-    uint64 m_pages;  // the pages a commit may use: the newest meta page's last + 1
-    bool m_writer;
+    uint64 m_pages;             // the pages a commit may use: the newest meta page's last + 1
     std::vector<uint8> m_seen;  // per page: 0, or what it was checked as
     std::vector<uint64> m_listedFree;
 };
@@ -488,7 +487,11 @@ uint64 NewestTxnId(const File& file) {
     return newest;
 }
 
-void CheckDataFileOnce(const std::string& dir, const File& file, bool writer) {
+// Checks data.mdb once: the meta pages and the file's length (a few reads,
+// whatever the file's size) and, when `walkPages`, every branch and leaf page
+// of both meta pages' trees. `writer`: an empty data.mdb alone in the
+// directory passes.
+void CheckDataFileOnce(const std::string& dir, const File& file, bool writer, bool walkPages) {
     struct stat st;
     if (::fstat(file.Fd(), &st) != 0) {
         Fail(dir, "cannot examine data.mdb: " + std::string(std::strerror(errno)),
@@ -515,15 +518,44 @@ void CheckDataFileOnce(const std::string& dir, const File& file, bool writer) {
                       std::to_string(needed) +
                       " its last commit needs (a partial copy, or a copy onto a full disk?)");
     }
+    if (!walkPages) {
+        return;
+    }
     // Both meta pages' trees: a reader picks its meta page by the lock file's
     // transaction id, which may name the older one. The older commit's pages
     // stay untouched until the commit after the next.
-    PageWalk walk(file, newest.pageSize, newest.lastPage + 1, writer);
+    PageWalk walk(file, newest.pageSize, newest.lastPage + 1);
     try {
         walk.Walk(newest, true);
         walk.Walk(&newest == &meta0 ? meta1 : meta0, false);
     } catch (const PageDamage& damage) {
         Fail(dir, "data.mdb is damaged: " + damage.what);
+    }
+}
+
+// CheckDataFileOnce, for a caller that may look while a writer commits (any
+// caller but the writer itself, which `writer` names): what it found counts
+// when no commit ended meanwhile (the pages it read were then untouched).
+// Otherwise it looks again; a writer that never pauses leaves its newest
+// pages unchecked, pages it wrote itself.
+void CheckDataFile(const std::string& dir, const File& file, bool writer, bool walkPages) {
+    if (writer) {
+        CheckDataFileOnce(dir, file, writer, walkPages);
+        return;
+    }
+    for (int attempt = 0; attempt < kReaderAttempts; ++attempt) {
+        const uint64 before = NewestTxnId(file);
+        try {
+            CheckDataFileOnce(dir, file, writer, walkPages);
+        } catch (const RuntimeError&) {
+            if (NewestTxnId(file) == before) {
+                throw;
+            }
+            continue;
+        }
+        if (NewestTxnId(file) == before) {
+            return;
+        }
     }
 }
 
@@ -571,28 +603,15 @@ void CheckLmdbDataFile(const std::string& dir, bool writer) {
         Fail(dir, "cannot open data.mdb: " + std::string(std::strerror(errno)),
              RuntimeError::CategoryOfErrno(errno));
     }
-    if (writer) {
-        CheckDataFileOnce(dir, file, writer);
-        return;
+    CheckDataFile(dir, file, writer, false);
+}
+
+void CheckLmdbPages(const std::string& dir) {
+    const File file(dir + "/data.mdb");
+    if (file.Fd() < 0) {
+        Fail(dir, "cannot open data.mdb: " + std::string(std::strerror(errno)));
     }
-    // A reader may look while the writer commits: what it found counts when
-    // no commit ended meanwhile (the pages it walked were then untouched).
-    // Otherwise it looks again; a writer that never pauses leaves its newest
-    // pages unchecked, pages it wrote itself.
-    for (int attempt = 0; attempt < kReaderAttempts; ++attempt) {
-        const uint64 before = NewestTxnId(file);
-        try {
-            CheckDataFileOnce(dir, file, writer);
-        } catch (const RuntimeError&) {
-            if (NewestTxnId(file) == before) {
-                throw;
-            }
-            continue;
-        }
-        if (NewestTxnId(file) == before) {
-            return;
-        }
-    }
+    CheckDataFile(dir, file, false, true);
 }
 
 std::optional<std::string> CheckLmdbLockFile(const std::string& dir, bool callerIsWriter) {

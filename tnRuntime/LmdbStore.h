@@ -3,21 +3,53 @@
 // The embedded on-disk store: object images, named roots, named counters and
 // the identity counter in one LMDB environment inside a directory.
 //
-// Directory contents: LMDB's "data.mdb" and "lock.mdb", nothing else. The
-// environment holds two named databases:
+// Directory contents: LMDB's "data.mdb" and "lock.mdb" (the files of callers,
+// such as a journal, may sit beside them). The environment holds two named
+// databases:
 //   "images"  key: identity, 8 bytes big-endian (so byte order is numeric
 //             order and the file reads the same on every host);
 //             value: the framed image record of tnRuntime/ImageRecord.h.
-//   "meta"    "format"        -> "TARNSTOR" + format version, 4 bytes LE (1)
-//             "next-identity" -> the identity counter, 8 bytes LE
-//             "root:<name>"   -> the identity of root <name>, 8 bytes LE
-//             "counter:<name>" -> the value of counter <name>, 8 bytes LE
-// A directory whose environment has no "meta" database with this format
-// marker is not a store and is refused.
+//   "meta"    one record under the key "state" that holds every meta value
+//             under one checksum (format version 2). All integers are
+//             little-endian:
+//               offset  size  field
+//               0       8     magic "TARNSTOR"
+//               8       4     format version, 2
+//               12      8     identity counter (the next identity to hand out)
+//               20      8     image bytes: the sum of the sizes of all image
+//                             records, as StoreStats::numImageBytes reports
+//               28      4     number of roots R
+//               32            R roots in increasing byte order of their
+//                             names, each: name length n (2), name (n bytes),
+//                             identity (8)
+//                       4     number of counters C
+//                             C counters in increasing byte order of their
+//                             names, each: name length n (2), name (n bytes),
+//                             value (8)
+//               end-8   8     XXH3-64 (seed 0) of all the bytes before it
+//             A name has at most 1024 bytes; a record without roots and
+//             counters has 44 bytes.
+// A directory whose environment has no "meta" database is not a store and
+// is refused. A "meta" database without the record (and without the marker
+// of format 1), and a record that is shorter than 44 bytes, fails its
+// checksum or does not parse, make a damaged store: every opener refuses it
+// with a RuntimeError; none takes it for a store without roots. A record of
+// another version is refused as an unsupported format.
+//
+// Format 1 kept each meta value under a key of its own, without a checksum:
+// "format" -> "TARNSTOR" + version 1 (4 bytes), "next-identity" -> the
+// identity counter, "root:<name>" -> an identity, "counter:<name>" -> a value
+// (8 bytes each), and no image bytes. A ReadOnly opener reads such a store as
+// it is and counts the image bytes when Stats asks. The first writable opener
+// upgrades it in place in one write transaction: it walks the pages (as
+// before any first change, see Faults below), counts the image bytes (one
+// walk of the images' leaves), writes the record and removes the old keys, so
+// that a crash leaves one format or the other; Repairs() reports the upgrade
+// and FormatVersion() the version found.
 //
 // Decisions:
 // - Atomicity: a Commit is one LMDB write transaction (images written, images
-//   deleted, roots, counter). LMDB's copy-on-write pages and its two meta
+//   deleted, the meta record). LMDB's copy-on-write pages and its two meta
 //   pages make the transaction all or nothing: after a crash the store holds
 //   the previous commit or the new one. Commits are synced to disk unless
 //   LmdbStoreOptions::syncOnCommit is off.
@@ -36,29 +68,68 @@
 //   them): a second opener in the same process is refused with "in use".
 //   A child made by fork() may open the store afresh (never use a store it
 //   inherited): it then counts as another process.
+// - Meta values: every Commit writes the whole meta record anew, in the same
+//   write transaction as the images. The writer keeps the values in memory:
+//   a commit makes its new values in a copy, which replaces them once the
+//   transaction has committed, so a failed commit leaves them as they were.
+//   FindRoot, Roots, FindCounter and NextIdentity answer from memory: the
+//   writer's as of its latest commit, a ReadOnly store's as read (and
+//   verified) once from its snapshot at Open.
+// - Stats: the number of images is LMDB's count and the image bytes are the
+//   record's, so Stats costs the same for any number of images (except for a
+//   format-1 store read as it is). Commit keeps the image bytes up to date:
+//   for a record it replaces or deletes it looks up the old record's size
+//   first, in the same transaction.
 // - Snapshots: a ReadOnly store holds one LMDB read transaction from Open to
 //   its destruction. Every read of it (Load, FindRoot, Roots, FindCounter,
 //   NextIdentity, ForEachIdentity, Stats) sees the commit that was the
 //   latest when it was opened, whatever the writer commits meanwhile; open
 //   it again to see newer commits. While it is open the writer cannot reuse
 //   the pages of that commit, so the file grows faster: keep readers short.
-//   A writable store reads the latest commit at every call.
+//   A writable store reads the latest commit, its own, at every call.
+// - Stores this process may not write: a ReadOnly opener that cannot write
+//   lock.mdb (a read-only mount, another user's store it may only read)
+//   opens without LMDB's lock (MDB_NOLOCK) and takes no reader slot. Alone,
+//   or beside other readers, that changes nothing. Beside a writer it does:
+//   the writer does not know of the snapshot, and may reuse its pages two
+//   commits later. Every image is checked against its checksum and identity
+//   and the meta record against its own, so such a reader then meets an
+//   error ("damaged store" or a checksum mismatch), not a wrong table; open
+//   it again for a newer snapshot. Compact() cannot see such a reader
+//   either: the file it mapped stays whole (the swap is a rename).
 // - Threads: every member may be called from any thread; calls are serialised
 //   by an internal mutex. A store must not be used in a child after fork().
-// - Faults: a missing directory (when it must exist), a directory that is not
-//   a store, a foreign or damaged file, permission problems and damaged
-//   records are all reported as RuntimeError naming the directory and, for a
-//   record, the identity. The record frame guards the image bytes. LMDB
-//   trusts its own pages, so before it maps the files (tnRuntime/
-//   LmdbFileCheck.h) data.mdb is checked against its meta pages (a short file
-//   would fault when touched) and its branch and leaf pages are walked, and
-//   lock.mdb's header is checked: a damaged lock file nobody uses is made
-//   anew and reported in Repairs(). Damage LMDB detects itself
-//   (MDB_CORRUPTED) arrives as a RuntimeError too. A write failed for a full
-//   disk says "no space left on device". Misuse by the caller (writing
-//   identity 0, committing to a read-only store) asserts.
+// - Faults: a missing directory (when it must exist), a directory that is not a
+//   store, a foreign or damaged file, permission problems and damaged records
+//   are all reported as RuntimeError naming the directory and, for a record,
+//   the identity. The record frame guards the image bytes, and the meta
+//   record's checksum the meta values. Before LMDB maps the files
+//   (tnRuntime/LmdbFileCheck.h), data.mdb is checked against its meta pages (a
+//   short file would fault when touched) and lock.mdb's header is checked: a
+//   few reads, whatever the size of the store. A damaged lock file nobody uses
+//   is made anew and reported in Repairs(). Opening walks no tree: it reads the
+//   few pages that lead to the meta record (and the images' leaves when it
+//   upgrades a format-1 store); LMDB reads the other pages as the calls need
+//   them, and trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND,
+//   MDB_CORRUPTED, MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map (or
+//   at a null pointer), or one of LMDB's assertions, while it reads a page
+//   (caught by a page guard: see LmdbStore.cpp; the first Open installs a
+//   process-wide handler for both signals, chained to the one before it),
+//   arrive as a RuntimeError "damaged store: ..." and poison the store: every
+//   later call throws the same error and nothing more is committed. A writer
+//   trusts pages no read checks (page flags, the page counts of the overflow
+//   runs it frees, the free-page lists), so before its first change after
+//   opening it walks every page with CheckLmdbPages, and a store found damaged
+//   then takes no change (its reads go on): a writer that writes pays for the
+//   walk, an opening does not. A page that is sound in itself but wrong can
+//   still give a wrong answer (most often an image not found). CheckLmdbPages
+//   walks every page, for whole-store validation and backups; a compacting
+//   CopyTo runs it itself. A write failed for a full disk says "no space left
+//   on device". Misuse by the caller (writing identity 0, committing to a
+//   read-only store) asserts.
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -69,8 +140,12 @@
 
 struct MDB_env;
 struct MDB_txn;
+struct MDB_val;
 
 namespace tarn {
+
+struct LmdbStoreState;
+struct LmdbPageGuard;
 
 enum class OpenMode {
     CreateIfMissing,  // make the directory and an empty store when there is none
@@ -110,57 +185,116 @@ public:
     StoreStats Stats() override;
 
     // The named counter as the latest commit holds it, also for a ReadOnly
-    // store (whose other reads see its snapshot).
+    // store (whose other reads see its snapshot): a ReadOnly store reads and
+    // verifies the latest meta record (or format-1 keys) for it.
     std::optional<uint64> FindLatestCounter(std::string_view name);
     // Writes a copy of the environment as of the latest commit into the
     // existing directory `dir`, as its data.mdb (which must not exist yet),
     // synced. `compact` leaves out free pages and renumbers the rest, so the
-    // copy is as small as its contents. Runs beside the writer; a copy holds
-    // one commit, whatever the writer commits meanwhile.
+    // copy is as small as its contents; it walks every page with
+    // CheckLmdbPages first (LMDB's compacting copy reads them all
+    // unguarded). Runs beside the writer; a copy holds one commit, whatever
+    // the writer commits meanwhile.
     void CopyTo(const std::string& dir, bool compact);
+    // Writers: rewrites data.mdb without its free pages (LMDB's compacting
+    // copy, after a walk of every page) and puts the copy in its place, when
+    // no other process has the store open. Returns false, changing nothing,
+    // when another process (a reader) has it open: the file it has mapped
+    // must stay as it is. The swap is a rename, so a crash leaves one file or
+    // the other, each a whole store.
+    //
+    // How others are kept out: LMDB's openers take a lock on the first byte
+    // of lock.mdb, exclusively if they can (then they are alone and set the
+    // lock file up), shared otherwise, and hold it while the store is open.
+    // With its own environment closed, the writer takes that lock exclusively
+    // (refused while any other process holds it), renames the copy into
+    // place and opens the new file, which LMDB then finds alone and sets up
+    // afresh. The descriptor of that lock stays open for the store's life: a
+    // process's locks on a file go with any descriptor of it that closes.
+    // An opener that opened the old data.mdb just before the rename and then
+    // waited for the lock sees one of the old file's two last commits: a
+    // consistent, older snapshot, never a mix.
+    bool Compact();
+    // A reader that opened without a slot in LMDB's lock file (see Open).
+    bool WithoutLock() const { return m_withoutLock; }
     // The bytes of the data file that the latest commit uses, or (when
     // `withoutFreePages`) about what a compacting copy of it takes.
     uint64 DataBytes(bool withoutFreePages = false);
 
     const std::string& Directory() const { return m_dir; }
-    // What opening repaired (a lock file made anew), one line each.
+    // What opening repaired or changed (a lock file made anew, the store
+    // upgraded from format 1), one line each.
     const std::vector<std::string>& Repairs() const { return m_repairs; }
+    // The store's format version as found when it was opened: 2, or 1 for a
+    // store of the older format (which a writable opener has upgraded to 2;
+    // see Repairs()). A store made by this opener is of version 2.
+    uint32 FormatVersion() const { return m_foundVersion; }
     // The current upper bound of the data file; grows as commits need it.
     std::size_t MapSize();
 
 private:
     class ReadScope;
     class LatestRead;
+    class Cursor;
 
     LmdbStore(std::string dir, const LmdbStoreOptions& options);
 
     void LockDirectory();
     void OpenEnvironment();
+    void FindMap();
+    void SetMapSize(std::size_t size, const char* doing);
     void OpenDatabases(OpenMode mode);
     void BeginSnapshot();
-    void CheckFormat(MDB_txn* txn);
+    LmdbStoreState ReadState(MDB_txn* txn, uint32* version, std::vector<std::string>* oldKeys);
+    LmdbStoreState ReadFormat1(MDB_txn* txn, std::vector<std::string>* oldKeys);
+    void WriteState(MDB_txn* txn, const LmdbStoreState& state);
+    uint64 SumImageBytes(MDB_txn* txn);
     template <class Apply>
     void WriteTransaction(Apply&& apply);
     void GrowMap();
     MDB_txn* BeginRead();
-    uint64 ReadMeta64(MDB_txn* txn, std::string_view key, bool* found);
+    template <class Call>
+    int Guarded(const char* doing, Call&& call);
+    template <class Call>
+    void CheckGuarded(const char* doing, Call&& call);
+    int Touch(const MDB_val& val) const noexcept;
+    int Get(MDB_txn* txn, unsigned int dbi, MDB_val* key, MDB_val* value, const char* doing);
+    [[noreturn]] void PageFault(const char* doing, const LmdbPageGuard& guard);
+    void ThrowIfPoisoned() const;
+    void WritablePages();
 
     [[noreturn]] void Fail(const std::string& what,
                            RuntimeError::Category category = RuntimeError::Category::Other) const;
-    void Check(int rc, std::string_view doing) const;
+    void Check(int rc, std::string_view doing);
 
     std::string m_dir;
     LmdbStoreOptions m_options;
     bool m_readOnly = false;
     int m_dirFd = -1;                         // holds a writer's flock
+    int m_compactLockFd = -1;                 // lock.mdb, kept open after a compaction
+    bool m_withoutLock = false;               // a reader that may not write lock.mdb
     bool m_registered = false;                // the directory is entered as open in this process
     std::pair<uint64, uint64> m_dirId{0, 0};  // the directory's device and inode
     MDB_env* m_env = nullptr;
+    // Where data.mdb is mapped (0, 0: not known), for the page guards.
+    std::uintptr_t m_mapBegin = 0;
+    std::uintptr_t m_mapEnd = 0;
+    std::size_t m_pageSize = 0;
+    // Once LMDB met a damaged page: the error every call throws.
+    std::string m_poisoned;
+    // A writer's walk of the pages before its first change: done, or the
+    // damage it found.
+    bool m_pagesChecked = false;
+    std::string m_unwritable;
     // A writer's reader: a reset read transaction, renewed per read. A
     // ReadOnly store's snapshot: one read transaction for its lifetime.
     MDB_txn* m_reader = nullptr;
     unsigned int m_images = 0;  // LMDB database handles (MDB_dbi)
     unsigned int m_meta = 0;
+    uint32 m_foundVersion = 0;
+    // The meta values: a writer's as of its latest commit, a ReadOnly
+    // store's as of its snapshot.
+    std::unique_ptr<LmdbStoreState> m_state;
     std::vector<std::string> m_repairs;
     std::mutex m_mutex;
 };

@@ -535,6 +535,28 @@ void OffsetOpsStore::Impl::Release() {
     closed = true;
 }
 
+namespace {
+
+int64 DataFileBytes(const std::string& dir) {
+    std::error_code ec;
+    const auto size = fs::file_size(fs::path(dir) / "data.mdb", ec);
+    return ec ? 0 : static_cast<int64>(size);
+}
+
+// Whether free pages take more than `share` of the data file (of at least a
+// MiB: a smaller file is not worth a copy).
+bool WorthCompacting(OffsetOpsStore::Impl& s, double share) {
+    constexpr int64 kFloor = int64{1} << 20;
+    const int64 file = DataFileBytes(s.dir);
+    if (s.lmdb == nullptr || share <= 0 || file < kFloor) {
+        return false;
+    }
+    const double used = static_cast<double>(s.lmdb->DataBytes(true));
+    return used < (1.0 - share) * static_cast<double>(file);
+}
+
+}  // namespace
+
 // --- Opening and closing -----------------------------------------------------------
 
 OffsetOpsStore::OffsetOpsStore(std::unique_ptr<Impl> impl) : m_impl(std::move(impl)) {}
@@ -605,6 +627,15 @@ void OffsetOpsStore::Close() {
                  (s.journal != nullptr && s.journal->FileBytes() > Journal::kHeaderBytes));
             if (changed) {
                 s.WriteCheckpoint();
+            }
+            if (WorthCompacting(s, s.options.compactFreeShare)) {
+                // The store is whole whatever happens here: a compaction
+                // that cannot run (another process has the store open) or
+                // fails leaves the old file in place.
+                try {
+                    (void)s.lmdb->Compact();
+                } catch (const RuntimeError&) {
+                }
             }
         } catch (...) {
             s.Release();
@@ -697,6 +728,25 @@ void OffsetOpsStore::Sync() {
         s.broken = true;
         throw;
     }
+}
+
+CompactResult OffsetOpsStore::Compact() {
+    Impl& s = Live();
+    s.RequireWritable();
+    if (s.lmdb == nullptr) {
+        throw RuntimeError("an in-memory store has no file to compact");
+    }
+    Checkpoint();
+    CompactResult result;
+    result.bytesBefore = DataFileBytes(s.dir);
+    try {
+        result.compacted = s.lmdb->Compact();
+    } catch (...) {
+        s.broken = true;  // the files are whole; this handle's environment may not be
+        throw;
+    }
+    result.bytesAfter = DataFileBytes(s.dir);
+    return result;
 }
 
 void OffsetOpsStore::Checkpoint() {

@@ -122,6 +122,12 @@ struct StoreOptions {
     // C * (30 KiB + 20 KiB) on top of the program's own.
     ssize_t cacheObjects = 0;
     static constexpr std::size_t kDeferredPerCacheObject = 256;
+    // A writer's Close() compacts the data file (see Compact()) when free
+    // pages take more than this share of it (0: never). Each checkpoint
+    // rewrites the nodes it changed on new pages and frees the old ones,
+    // which LMDB reuses only two commits later: a store whose checkpoints
+    // rewrite most of the tree carries about twice its size in free pages.
+    double compactFreeShare = 0.5;
 };
 
 class FieldCursor;
@@ -216,6 +222,12 @@ struct MergeResult {
     int64 taken = 0;       // site records taken from it (with a dry run: would be)
     int64 operations = 0;  // operations recorded for them
     int64 conflicts = 0;
+};
+
+struct CompactResult {
+    bool compacted = false;  // false: another process has the store open
+    int64 bytesBefore = 0;   // the data file
+    int64 bytesAfter = 0;
 };
 
 struct BackupOptions {
@@ -315,6 +327,14 @@ public:
     // stores are walked in key order, the one merged from within
     // `options.cacheObjects`, this one within its own bound.
     MergeResult Merge(const std::filesystem::path& from, const MergeOptions& options = {});
+
+    // Writers of on-disk stores: a checkpoint, then the data file rewritten
+    // without its free pages and put in place of the old one (a rename: a
+    // crash leaves one or the other, each whole). Only when no other process
+    // has the store open (a reader maps the file); otherwise nothing changes
+    // and `compacted` is false. Costs a read of the whole file and a write
+    // of what it holds.
+    CompactResult Compact();
 
     // --- Backups ----------------------------------------------------------------
 

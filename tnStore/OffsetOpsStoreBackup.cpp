@@ -213,9 +213,9 @@ RuntimeError AsSourceError(const std::string& dir, const fs::path& copy, const R
     return RuntimeError(e.GetCategory(), "no backup made: " + what);
 }
 
-// Opens the copied data file as any opening does (which checks its pages
-// and makes its lock file, whose absence a later opening would report as a
-// repair), looks up every image in it and each root's (each image is
+// Opens the copied data file as any opening does (which makes its lock
+// file, whose absence a later opening would report as a repair), looks up
+// every image in it and each root's (each image is
 // checked against its checksum: a copy that cannot be read back is no
 // backup), and returns the journal
 // position its checkpoint covers (0 when it has none: a store made before
@@ -263,7 +263,7 @@ void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
         options.mode = StoreMode::Read;
         options.cacheObjects = kCheckCacheObjects;
         OffsetOpsStore copied = OffsetOpsStore::Open(copy.string(), options);
-        const StoreValidation v = copied.Validate();
+        const StoreValidation v = copied.Validate();  // LMDB's pages included
         if (!v.check.Ok()) {
             throw RuntimeError(
                 RuntimeError::Category::Damaged,

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
+#include "tnRuntime/LmdbFileCheck.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnStore/Reachability.h"
 #include "tnStore/StoreImpl.h"
@@ -245,6 +246,15 @@ StoreValidation OffsetOpsStore::Validate() {
         v.check.numProblems = check.numProblems;
         if (s.options.cacheObjects > 0) {
             s.space->EvictCleanResidents(s.options.cacheObjects / 2);
+        }
+    }
+    if (!s.dir.empty()) {
+        // LMDB's own pages: opening reads only those on the paths it takes.
+        try {
+            CheckLmdbPages(s.dir);
+        } catch (const RuntimeError& e) {
+            v.check.problems.push_back(e.what());
+            ++v.check.numProblems;
         }
     }
     CSpace stored(s.store);

@@ -21,9 +21,9 @@ const OptionSpec* CommandSpec::Option(std::string_view name) const {
 
 const std::vector<CommandSpec>& Commands() {
     static const std::vector<CommandSpec> table = {
-        RecordCommand(),   ShowCommand(),  ExportCommand(), DiffCommand(),
-        BackupCommand(),   SitesCommand(), MergeCommand(),  DumpCommand(),
-        ValidateCommand(), StatsCommand(), ClearCommand(),
+        RecordCommand(), ShowCommand(),     ExportCommand(), DiffCommand(),
+        BackupCommand(), SitesCommand(),    MergeCommand(),  CompactCommand(),
+        DumpCommand(),   ValidateCommand(), StatsCommand(),  ClearCommand(),
     };
     return table;
 }

@@ -29,6 +29,7 @@ CommandSpec DiffCommand();
 CommandSpec BackupCommand();
 CommandSpec SitesCommand();
 CommandSpec MergeCommand();
+CommandSpec CompactCommand();
 CommandSpec DumpCommand();
 CommandSpec ValidateCommand();
 CommandSpec StatsCommand();
