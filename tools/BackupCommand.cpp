@@ -18,6 +18,7 @@ namespace fs = std::filesystem;
 constexpr const char* kPartialSuffix = ".backup-";
 
 int RunBackup(const Arguments& args, Io& io) {
+    CatchStopSignals();
     const std::string dir = args.Store();
     const std::string to = args.Required("--to", "the copy's directory");
     const bool compact = args.Flag("--compact");

@@ -83,6 +83,7 @@ private:
 };
 
 int RunExport(const Arguments& args, Io& io) {
+    CatchStopSignals();
     const std::string dir = args.Store();
     const std::string outFile = args.Text("--out").value_or("");
     if (args.Has("--out") && outFile.empty()) {

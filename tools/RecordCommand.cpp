@@ -240,6 +240,7 @@ GeneratorSettings GeneratorSettingsOf(const Arguments& args) {
 }
 
 int RunRecord(const Arguments& args, Io& io) {
+    CatchStopSignals();
     RecordSettings settings;
     settings.store = args.Store();
     const bool generate = args.Has("--generate");

@@ -5,14 +5,12 @@
 #include <iostream>
 
 #include "tools/CommandLine.h"
-#include "tools/Interrupt.h"
 #include "tools/Output.h"
 
 int main(int argc, char** argv) {
     // A write to a closed pipe fails instead of killing the program in the
     // middle of its work (a merge, say); the program ends quietly below.
     std::signal(SIGPIPE, SIG_IGN);
-    tarn::tool::CatchStopSignals();
     int status = tarn::tool::RunOffsetOps(argc, argv, std::cout, std::cerr);
     std::cout.flush();
     if (tarn::tool::StandardOutputClosed()) {
