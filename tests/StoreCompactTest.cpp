@@ -64,7 +64,7 @@ TEST_F(StoreCompact, CloseCompactsAStoreMostlyFreePages) {
         store.Close();
     }
     const int64 after = FileBytes();
-    EXPECT_LT(after * 2, before) << before << " bytes before closing, " << after << " after";
+    EXPECT_LT(after * 3, before * 2) << before << " bytes before closing, " << after << " after";
     OffsetOpsStore reopened = OffsetOpsStore::Open(m_dir);
     EXPECT_EQ(AllTables(reopened), tables);
     EXPECT_TRUE(reopened.Validate().Ok());
@@ -121,7 +121,7 @@ TEST_F(StoreCompact, ExplicitCompactWaitsForOtherProcessesToClose) {
 
     const CompactResult done = writer.Compact();
     EXPECT_TRUE(done.compacted);
-    EXPECT_LT(done.bytesAfter * 2, done.bytesBefore);
+    EXPECT_LT(done.bytesAfter * 3, done.bytesBefore * 2);
     EXPECT_EQ(AllTables(writer), tables);
     writer.Record(Opid(Site(9), 1), Field(2), 1);  // the handle goes on, on the new file
     writer.Close();

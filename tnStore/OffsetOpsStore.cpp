@@ -504,6 +504,15 @@ void OffsetOpsStore::Impl::WriteCheckpoint() {
         space->SetCounter(kJournalPositionCounter, durable);
         SetTreeSummary(*space, bounds);
         CommitDurably();
+        if (lmdb != nullptr) {
+            // LMDB reuses the pages a commit freed only from the second
+            // commit after it: an empty one now lets the next checkpoint
+            // write over the pages this one freed, instead of growing the
+            // file by another copy of what it changes.
+            CommitBatch nothing;
+            nothing.nextIdentity = store->NextIdentity();
+            store->Commit(nothing);
+        }
         checkpointed = durable;
         ++checkpoints;
         NotePeak();

@@ -124,10 +124,10 @@ struct StoreOptions {
     static constexpr std::size_t kDeferredPerCacheObject = 256;
     // A writer's Close() compacts the data file (see Compact()) when free
     // pages take more than this share of it (0: never). Each checkpoint
-    // rewrites the nodes it changed on new pages and frees the old ones,
-    // which LMDB reuses only two commits later: a store whose checkpoints
-    // rewrite most of the tree carries about twice its size in free pages.
-    double compactFreeShare = 0.5;
+    // rewrites the nodes it changed on new pages and frees the old ones: a
+    // store whose checkpoints rewrite most of the tree carries up to its own
+    // size in free pages between them.
+    double compactFreeShare = 0.25;
 };
 
 class FieldCursor;
