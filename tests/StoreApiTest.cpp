@@ -126,8 +126,8 @@ TEST(FieldCursors, SeeChangesBeyondTheirBatchAndNoFieldTwice) {
     Fill(store, 1000);
     FieldCursor cursor(store);
     const FieldId first = cursor.Key();
-    store.Record(Opid(Site(9), 5000), first, 5);       // in the batch held
-    store.Record(Opid(Site(9), 5000), Field(801), 1);  // far ahead, a new key
+    store.Record(Opid(Site(9), 5000), first, 5);        // in the batch held
+    store.Record(Opid(Site(9), 5000), Field(801), 1);   // far ahead, a new key
     store.Record(Opid(Site(9), 5000), Field(1001), 1);  // after the last key
     EXPECT_EQ(cursor.Table().size(), 1u);
     std::vector<FieldId> seen;
