@@ -346,10 +346,10 @@ Contents ReadTarn(const std::string& dir) {
     options.mode = StoreMode::Read;
     OffsetOpsStore store = OffsetOpsStore::Open(dir, options);
     Contents c;
-    store.ForEach([&c](const FieldId&, const OffsetOpsOnField<int64>& table) {
-        for (const auto& [site, so] : table.m_map) {
+    store.ForEach([&c](const FieldId&, const FieldTable& table) {
+        for (const SiteRecord& r : table) {
             ++c.records;
-            c.sum += so.o;
+            c.sum += r.o;
         }
         return true;
     });

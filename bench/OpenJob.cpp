@@ -299,9 +299,9 @@ CaseResult RunLibraryCase(Op op, uint64 n, int rep, const std::string& tarnDir,
             options.mode = StoreMode::Read;
             OffsetOpsStore store = OffsetOpsStore::Open(tarnDir, options);
             r.openSeconds = Now() - start;
-            const std::unique_ptr<OffsetOpsOnField<int64>> table = store.Find(FieldOf(key));
+            const std::optional<FieldTable> table = store.Find(FieldOf(key));
             store.Close();
-            Require(table != nullptr && table->m_map.size() == kSites,
+            Require(table && table->size() == kSites,
                     "the middle field's table is missing or has the wrong sites");
             break;
         }

@@ -19,6 +19,7 @@
 #include <string_view>
 
 #include "fuzz/FuzzStore.h"
+#include "tnStore/FieldIdText.h"
 #include "tools/OpsFile.h"
 
 namespace {
@@ -47,15 +48,14 @@ void CheckLine(std::string_view line) {
 
 void CheckFieldId(std::string_view text) {
     std::string error;
-    const std::optional<tarn::FieldId> fid = tarn::tool::ParseFieldId(text, &error);
+    const std::optional<tarn::FieldId> fid = tarn::ParseFieldId(text, &error);
     if (!fid) {
         if (error.empty()) {
             tarn::fuzz::PropertyFailed("a rejected key has no message");
         }
         return;
     }
-    const std::optional<tarn::FieldId> again =
-        tarn::tool::ParseFieldId(tarn::ToString(*fid), &error);
+    const std::optional<tarn::FieldId> again = tarn::ParseFieldId(tarn::ToString(*fid), &error);
     if (!again || *again != *fid) {
         tarn::fuzz::PropertyFailed("a printed key does not parse back to itself");
     }

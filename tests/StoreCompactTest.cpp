@@ -104,7 +104,7 @@ TEST_F(StoreCompact, ExplicitCompactWaitsForOtherProcessesToClose) {
         (void)!::write(ready[1], &c, 1);
         (void)!::read(release[0], &c, 1);
         // The file under the reader is the one it opened.
-        ::_exit(reader.Find(Field(5)) != nullptr && reader.Validate().Ok() ? 0 : 1);
+        ::_exit(reader.Find(Field(5)).has_value() && reader.Validate().Ok() ? 0 : 1);
     }
     char c;
     ASSERT_EQ(::read(ready[0], &c, 1), 1);
@@ -129,7 +129,7 @@ TEST_F(StoreCompact, ExplicitCompactWaitsForOtherProcessesToClose) {
     reading.mode = StoreMode::Read;
     OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, reading);
     EXPECT_TRUE(reader.Validate().Ok());
-    EXPECT_EQ(reader.Find(Field(2))->m_map.getmap().size(), 2u);
+    EXPECT_EQ(reader.Find(Field(2))->size(), 2u);
 }
 
 }  // namespace

@@ -14,9 +14,9 @@ using Tables = std::map<FieldId, std::map<Guid, std::pair<int64, int64>>>;
 
 inline Tables AllTables(OffsetOpsStore& store) {
     Tables tables;
-    store.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
-        for (const auto& [site, so] : table.m_map.getmap()) {
-            tables[field][site] = {so.t, so.o};
+    store.ForEach([&](const FieldId& field, const FieldTable& table) {
+        for (const SiteRecord& r : table) {
+            tables[field][r.site] = {r.t, r.o};
         }
         return true;
     });

@@ -76,7 +76,7 @@ TEST(OpsFileParsing, ReadsFieldsAroundBlanksAndCommentsAndSaysWhatIsWrongWithALi
                     HasSubstr(expected))
             << line;
     }
-    EXPECT_EQ(ToString(*tool::ParseFieldId("12", nullptr)), "#12/");
+    EXPECT_EQ(ToString(*ParseFieldId("12", nullptr)), "#12/");
 }
 
 // ---------------------------------------------------------------------------
@@ -184,7 +184,8 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
              help},
         {{"frobnicate"},
          2,
-         "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, compact, "
+         "unknown command 'frobnicate': use record, show, export, diff, backup, sites, merge, "
+         "compact, "
          "dump, validate, "
          "stats or"},
         {{"--bogus", "show"}, 2, "unknown option '--bogus': options follow the command" + help},
@@ -229,7 +230,9 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
              "264 operations of this run before it are durable, nothing from it on"},
         {record, 1,
          "ops.txt:5: offset '3x' is not a signed decimal integer; stopped there: the 3 "
-         "operations of this run before it are durable, nothing from it on",
+         "operations of this run before it are durable, nothing from it on; to go on after "
+         "fixing it: offsetops record --store " +
+             store + " --ops " + ops + " --skip 4",
          kSiteA + ",3,8,,3x\n" + kSiteA + ",4,9,,1\n",
          kSiteA + ",1,7,0a,3\n" + kSiteB + ",2,7,0a,4\n# comment\n" + kSiteA + ",2,8,,-1\n"},
         // Equal stamps, and an older one on another field, are taken.
@@ -255,7 +258,10 @@ TEST(ToolErrors, EachEndsWithOneLineAndItsStatusKeepingWhatCameBefore) {
          kSiteA + ",4294967295,5,,1\n"},
     };
     for (const char* command : {"show", "dump", "validate", "stats", "clear"}) {
-        cases.push_back({{command, "--store", missing}, 1, "directory does not exist"});
+        cases.push_back(
+            {{command, "--store", missing},
+             1,
+             "store '" + missing + "' does not exist; 'offsetops record' creates stores"});
     }
     for (const Case& c : cases) {
         dir.Write("ops.txt", c.kept + c.input);
@@ -365,7 +371,7 @@ TEST(ToolStores, DamagedAndForeignImagesAreReportedNotCrashedOn) {
     CopyImage(base, leaf, 999999);
     ToolRun run = Tool({"validate", "--store", base});
     EXPECT_EQ(run.status, 1);
-    EXPECT_THAT(run.out, HasSubstr("problem: 1 images that no root reaches: #999999"));
+    EXPECT_THAT(run.out, HasSubstr("problem: 1 image that no root reaches: #999999"));
     EXPECT_THAT(run.err, OneLineWith("validation of"));
     EXPECT_NE(Shown(base), "");
 

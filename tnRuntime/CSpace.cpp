@@ -89,8 +89,9 @@ void CheckClass(ptr<IPersistable> obj, OID oid, const ReflectedClass* expected) 
     }
     const ReflectedClass* actual = obj->GetReflectedClass();
     if (actual != expected) {
-        throw RuntimeError(ObjectName(oid) + " is of class '" + actual->m_name + "', not '" +
-                           expected->m_name + "'");
+        throw RuntimeError(RuntimeError::Category::Damaged, ObjectName(oid) + " is of class '" +
+                                                                actual->m_name + "', not '" +
+                                                                expected->m_name + "'");
     }
 }
 
@@ -146,22 +147,26 @@ ptr<IPersistable> CSpace::Resolve(OID oid, const ReflectedClass* expected) {
 ptr<IPersistable> CSpace::Load(OID oid, const ReflectedClass* expected) {
     std::optional<StoredImage> image = m_store->Load(oid.value_);
     if (!image) {
-        throw RuntimeError(ObjectName(oid) + " has no image in the store");
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           ObjectName(oid) + " has no image in the store");
     }
     const ReflectedClass* rc = FindReflectedClass(image->className);
     if (rc == nullptr) {
-        throw RuntimeError(ObjectName(oid) + " has an image of unknown class '" + image->className +
-                           "'");
+        throw RuntimeError(
+            RuntimeError::Category::Damaged,
+            ObjectName(oid) + " has an image of unknown class '" + image->className + "'");
     }
     if (expected != nullptr && rc != expected) {
-        throw RuntimeError(ObjectName(oid) + " has an image of class '" + image->className +
-                           "' where '" + expected->m_name + "' was expected");
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           ObjectName(oid) + " has an image of class '" + image->className +
+                               "' where '" + expected->m_name + "' was expected");
     }
     if (ImageCheckFn check = FindImageCheck(rc)) {
         std::string problem = check(image->bytes.data(), image->bytes.size());
         if (!problem.empty()) {
-            throw RuntimeError(ObjectName(oid) + " has a malformed image of class '" +
-                               image->className + "': " + problem);
+            throw RuntimeError(RuntimeError::Category::Damaged,
+                               ObjectName(oid) + " has a malformed image of class '" +
+                                   image->className + "': " + problem);
         }
     }
     ptr<IObject> created = rc->m_createFn != nullptr ? rc->m_createFn() : ptr<IObject>();
@@ -181,9 +186,10 @@ ptr<IPersistable> CSpace::Load(OID oid, const ReflectedClass* expected) {
         obj->Deserialise(ar);
         const auto consumed = static_cast<std::size_t>(ar.ptr() - image->bytes.data());
         if (consumed != size) {
-            throw RuntimeError(ObjectName(oid) + " of class '" + image->className +
-                               "': reading consumed " + std::to_string(consumed) + " of " +
-                               std::to_string(size) + " bytes");
+            throw RuntimeError(RuntimeError::Category::Damaged,
+                               ObjectName(oid) + " of class '" + image->className +
+                                   "': reading consumed " + std::to_string(consumed) + " of " +
+                                   std::to_string(size) + " bytes");
         }
     } catch (...) {
         DiscardUnregistered(obj);

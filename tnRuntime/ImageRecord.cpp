@@ -26,7 +26,8 @@ uint64 Checksum(uint64 oid, const octet_t* bytes, std::size_t size) {
 }
 
 [[noreturn]] void Fail(uint64 oid, const std::string& what) {
-    throw RuntimeError("image #" + std::to_string(oid) + ": " + what);
+    throw RuntimeError(RuntimeError::Category::Damaged,
+                       "image #" + std::to_string(oid) + ": " + what);
 }
 
 std::string Hex(uint64 value) {

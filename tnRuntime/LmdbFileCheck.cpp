@@ -90,14 +90,17 @@ constexpr int kReaderAttempts = 5;
 // A failed write is blamed on a full disk when less than this is left.
 constexpr uint64 kNearlyFullBytes = uint64{1} << 20;
 
-[[noreturn]] void Fail(const std::string& dir, const std::string& what) {
-    throw RuntimeError("LMDB store '" + dir + "': " + what);
+[[noreturn]] void Fail(const std::string& dir, const std::string& what,
+                       RuntimeError::Category category = RuntimeError::Category::Damaged) {
+    throw RuntimeError(category, "LMDB store '" + dir + "': " + what);
 }
 
 // After a failed File::ReadAt of `name`.
 [[noreturn]] void FailReading(const std::string& dir, const std::string& name) {
-    Fail(dir, "cannot read " + name + ": " +
-                  (errno != 0 ? std::strerror(errno) : "it ended while being read"));
+    Fail(dir,
+         "cannot read " + name + ": " +
+             (errno != 0 ? std::strerror(errno) : "it ended while being read"),
+         errno != 0 ? RuntimeError::CategoryOfErrno(errno) : RuntimeError::Category::Io);
 }
 
 uint64 GetLe(const octet_t* in, std::size_t width) {
@@ -491,7 +494,8 @@ uint64 NewestTxnId(const File& file) {
 void CheckDataFileOnce(const std::string& dir, const File& file, bool writer, bool walkPages) {
     struct stat st;
     if (::fstat(file.Fd(), &st) != 0) {
-        Fail(dir, "cannot examine data.mdb: " + std::string(std::strerror(errno)));
+        Fail(dir, "cannot examine data.mdb: " + std::string(std::strerror(errno)),
+             RuntimeError::CategoryOfErrno(errno));
     }
     const auto size = static_cast<uint64>(st.st_size);
     if (size == 0) {
@@ -596,7 +600,8 @@ void CheckLmdbDataFile(const std::string& dir, bool writer) {
         if (errno == ENOENT) {
             return;
         }
-        Fail(dir, "cannot open data.mdb: " + std::string(std::strerror(errno)));
+        Fail(dir, "cannot open data.mdb: " + std::string(std::strerror(errno)),
+             RuntimeError::CategoryOfErrno(errno));
     }
     CheckDataFile(dir, file, writer, false);
 }
@@ -614,7 +619,8 @@ std::optional<std::string> CheckLmdbLockFile(const std::string& dir, bool caller
     File file(path);
     if (file.Fd() < 0) {
         if (errno != ENOENT) {
-            Fail(dir, "cannot open lock.mdb: " + std::string(std::strerror(errno)));
+            Fail(dir, "cannot open lock.mdb: " + std::string(std::strerror(errno)),
+                 RuntimeError::CategoryOfErrno(errno));
         }
         struct stat st;
         if (::stat((dir + "/data.mdb").c_str(), &st) == 0 && st.st_size > 0) {
@@ -624,7 +630,8 @@ std::optional<std::string> CheckLmdbLockFile(const std::string& dir, bool caller
     }
     struct stat st;
     if (::fstat(file.Fd(), &st) != 0) {
-        Fail(dir, "cannot examine lock.mdb: " + std::string(std::strerror(errno)));
+        Fail(dir, "cannot examine lock.mdb: " + std::string(std::strerror(errno)),
+             RuntimeError::CategoryOfErrno(errno));
     }
     const auto size = static_cast<uint64>(st.st_size);
     std::string problem;

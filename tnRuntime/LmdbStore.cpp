@@ -227,8 +227,9 @@ constexpr std::size_t kTouchStride = 4096;
 // aborted, the map grown and the transaction run again.
 struct MapFull {};
 
-[[noreturn]] void FailAt(const std::string& dir, const std::string& what) {
-    throw RuntimeError("LMDB store '" + dir + "': " + what);
+[[noreturn]] void FailAt(const std::string& dir, const std::string& what,
+                         RuntimeError::Category category = RuntimeError::Category::Other) {
+    throw RuntimeError(category, "LMDB store '" + dir + "': " + what);
 }
 
 MDB_val Val(const void* data, std::size_t size) {
@@ -347,7 +348,7 @@ void PrepareDirectory(const std::string& dir, OpenMode mode) {
     const fs::file_status status = fs::status(dir, ec);
     if (status.type() == fs::file_type::not_found) {
         if (mode != OpenMode::CreateIfMissing) {
-            FailAt(dir, "directory does not exist");
+            FailAt(dir, "directory does not exist", RuntimeError::Category::NotFound);
         }
         fs::create_directories(dir, ec);
         if (ec) {
@@ -435,15 +436,18 @@ std::string EncodeState(const LmdbStoreState& state) {
 LmdbStoreState DecodeState(const std::string& dir, std::span<const octet_t> record) {
     const std::string damaged = "damaged store: the meta record \"state\" ";
     if (record.size() < kEmptyStateBytes) {
-        FailAt(dir, damaged + "has " + std::to_string(record.size()) + " bytes, fewer than the " +
-                        std::to_string(kEmptyStateBytes) + " of the smallest (wrong length)");
+        FailAt(dir,
+               damaged + "has " + std::to_string(record.size()) + " bytes, fewer than the " +
+                   std::to_string(kEmptyStateBytes) + " of the smallest (wrong length)",
+               RuntimeError::Category::Damaged);
     }
     const std::size_t body = record.size() - kChecksumBytes;
     if (XXH3_64bits(record.data(), body) != GetLe(record.data() + body, kChecksumBytes)) {
-        FailAt(dir, damaged + "does not match its checksum (checksum mismatch)");
+        FailAt(dir, damaged + "does not match its checksum (checksum mismatch)",
+               RuntimeError::Category::Damaged);
     }
     if (!std::equal(kFormatMagic.begin(), kFormatMagic.end(), record.begin())) {
-        FailAt(dir, damaged + "lacks the magic \"TARNSTOR\"");
+        FailAt(dir, damaged + "lacks the magic \"TARNSTOR\"", RuntimeError::Category::Damaged);
     }
     if (const uint64 version = GetLe(record.data() + kStateVersionOffset, 4);
         version != kFormatVersion) {
@@ -460,7 +464,7 @@ LmdbStoreState DecodeState(const std::string& dir, std::span<const octet_t> reco
             throw Unparsable{std::to_string(reader.Left()) + " bytes follow the counters"};
         }
     } catch (const Unparsable& e) {
-        FailAt(dir, damaged + "cannot be parsed: " + e.what);
+        FailAt(dir, damaged + "cannot be parsed: " + e.what, RuntimeError::Category::Damaged);
     }
     return state;
 }
@@ -564,7 +568,7 @@ void LmdbStore::PageFault(const char* doing, const LmdbPageGuard& guard) {
                      std::to_string(offset / std::max<std::size_t>(m_pageSize, 1)) +
                      "; data.mdb has " + fileBytes + " bytes)";
     }
-    throw RuntimeError(m_poisoned);
+    throw RuntimeError(RuntimeError::Category::Damaged, m_poisoned);
 }
 
 // Before the writer's first change, every page is walked (CheckLmdbPages),
@@ -589,12 +593,12 @@ void LmdbStore::WritablePages() {
             m_unwritable = std::string(e.what()) + "; the store takes no more changes";
         }
     }
-    throw RuntimeError(m_unwritable);
+    throw RuntimeError(RuntimeError::Category::Damaged, m_unwritable);
 }
 
 void LmdbStore::ThrowIfPoisoned() const {
     if (!m_poisoned.empty()) {
-        throw RuntimeError(m_poisoned);
+        throw RuntimeError(RuntimeError::Category::Damaged, m_poisoned);
     }
 }
 
@@ -739,7 +743,8 @@ void LmdbStore::LockDirectory() {
             g_openDirsPid = ::getpid();
         }
         if (!g_openDirs.insert(m_dirId).second) {
-            Fail("in use: the store is already open in this process");
+            Fail("in use: the store is already open in this process",
+                 RuntimeError::Category::InUse);
         }
         m_registered = true;
     }
@@ -748,7 +753,8 @@ void LmdbStore::LockDirectory() {
     }
     if (::flock(m_dirFd, LOCK_EX | LOCK_NB) != 0) {
         if (errno == EWOULDBLOCK) {
-            Fail("in use: another writer (in this or another process) holds the store");
+            Fail("in use: another writer (in this or another process) holds the store",
+                 RuntimeError::Category::InUse);
         }
         Fail(std::string("cannot lock the directory: ") + std::strerror(errno));
     }
@@ -845,7 +851,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
                 return mdb_dbi_open(txn, kImagesDb, 0, &m_images);
             });
             if (rcImages == MDB_NOTFOUND) {
-                Fail("damaged store: the \"images\" database is missing");
+                Fail("damaged store: the \"images\" database is missing",
+                     RuntimeError::Category::Damaged);
             }
             Check(rcImages, "opening the images database");
         } catch (...) {
@@ -893,7 +900,8 @@ void LmdbStore::OpenDatabases(OpenMode mode) {
             return mdb_dbi_open(txn, kImagesDb, 0, &m_images);
         });
         if (rcImages == MDB_NOTFOUND) {
-            Fail("damaged store: the \"images\" database is missing");
+            Fail("damaged store: the \"images\" database is missing",
+                 RuntimeError::Category::Damaged);
         }
         Check(rcImages, "opening the images database");
         std::vector<std::string> oldKeys;
@@ -944,7 +952,8 @@ LmdbStoreState LmdbStore::ReadState(MDB_txn* txn, uint32* version,
     if (rc == MDB_NOTFOUND) {
         Fail(
             "damaged store: the meta record \"state\" is missing (and there is no format-1 "
-            "marker)");
+            "marker)",
+            RuntimeError::Category::Damaged);
     }
     Check(rc, "reading the format marker");
     const std::string_view marker = Text(value);
@@ -984,7 +993,8 @@ LmdbStoreState LmdbStore::ReadFormat1(MDB_txn* txn, std::vector<std::string>* ol
         }
         if (value.mv_size != 8) {
             Fail("damaged store: meta entry '" + std::string(name) + "' has " +
-                 std::to_string(value.mv_size) + " bytes, expected 8");
+                     std::to_string(value.mv_size) + " bytes, expected 8",
+                 RuntimeError::Category::Damaged);
         }
         const uint64 number = GetLe(Bytes(value).data(), 8);
         if (next) {
@@ -1003,7 +1013,7 @@ LmdbStoreState LmdbStore::ReadFormat1(MDB_txn* txn, std::vector<std::string>* ol
         Check(rc, "reading the meta values");
     }
     if (!haveNext) {
-        Fail("damaged store: the identity counter is missing");
+        Fail("damaged store: the identity counter is missing", RuntimeError::Category::Damaged);
     }
     return state;
 }
@@ -1457,7 +1467,8 @@ void LmdbStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
                  rc = cursor.Get(&key, &value, MDB_NEXT, touching)) {
                 if (key.mv_size != 8) {
                     Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
-                         " bytes, expected 8");
+                             " bytes, expected 8",
+                         RuntimeError::Category::Damaged);
                 }
                 chunk.push_back(IdentityOfKey(key));
             }
@@ -1488,8 +1499,9 @@ std::optional<uint64> LmdbStore::LargestIdentity() {
     }
     Check(rc, "finding the largest identity");
     if (key.mv_size != 8) {
-        Fail("damaged store: an image key has " + std::to_string(key.mv_size) +
-             " bytes, expected 8");
+        Fail(
+            "damaged store: an image key has " + std::to_string(key.mv_size) + " bytes, expected 8",
+            RuntimeError::Category::Damaged);
     }
     return IdentityOfKey(key);
 }
@@ -1550,8 +1562,8 @@ std::size_t LmdbStore::MapSize() {
     return info.me_mapsize;
 }
 
-void LmdbStore::Fail(const std::string& what) const {
-    FailAt(m_dir, what);
+void LmdbStore::Fail(const std::string& what, RuntimeError::Category category) const {
+    FailAt(m_dir, what, category);
 }
 
 // LMDB's codes for damage it found in its pages poison the store as a fault
@@ -1570,9 +1582,10 @@ void LmdbStore::Check(int rc, std::string_view doing) {
         m_poisoned = "LMDB store '" + m_dir + "': damaged store: " + std::string(doing) + ": " +
                      (rc == kPastTheMap ? "LMDB places a key or value past the end of its map"
                                         : mdb_strerror(rc));
-        throw RuntimeError(m_poisoned);
+        throw RuntimeError(RuntimeError::Category::Damaged, m_poisoned);
     }
-    Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)));
+    Fail(std::string(doing) + ": " + LmdbFailureText(m_dir, rc, mdb_strerror(rc)),
+         rc > 0 ? RuntimeError::CategoryOfErrno(rc) : RuntimeError::Category::Other);
 }
 
 std::unique_ptr<IStore> OpenStore(const std::string& dir, OpenMode mode) {

@@ -265,7 +265,8 @@ private:
     void ThrowIfPoisoned() const;
     void WritablePages();
 
-    [[noreturn]] void Fail(const std::string& what) const;
+    [[noreturn]] void Fail(const std::string& what,
+                           RuntimeError::Category category = RuntimeError::Category::Other) const;
     void Check(int rc, std::string_view doing);
 
     std::string m_dir;

@@ -19,7 +19,7 @@ std::string TempDirectory() {
 }
 
 [[noreturn]] void Failed(const std::string& doing, int error) {
-    throw RuntimeError(doing + ": " + SystemErrorText(error));
+    throw RuntimeError(RuntimeError::CategoryOfErrno(error), doing + ": " + SystemErrorText(error));
 }
 
 // An unlinked temporary file, open for reading and writing.

@@ -73,12 +73,14 @@ std::string JoinPath(const std::string& dir, const char* name) {
 }
 
 [[noreturn]] void IoError(const std::string& path, const char* action, int error) {
-    throw RuntimeError("journal '" + path + "': cannot " + action + ": " + SystemErrorText(error));
+    throw RuntimeError(RuntimeError::CategoryOfErrno(error),
+                       "journal '" + path + "': cannot " + action + ": " + SystemErrorText(error));
 }
 
 [[noreturn]] void Damage(const std::string& path, uint64 offset, const std::string& what) {
-    throw RuntimeError("journal '" + path + "' is damaged at byte " + std::to_string(offset) +
-                       ": " + what);
+    throw RuntimeError(
+        RuntimeError::Category::Damaged,
+        "journal '" + path + "' is damaged at byte " + std::to_string(offset) + ": " + what);
 }
 
 void EncodeFileHeader(uint64 base, octet_t* out) {
@@ -277,7 +279,8 @@ int Journal::OpenForReading(const std::string& path) {
     UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (fd.Get() < 0) {
         if (errno == ENOENT) {
-            throw RuntimeError("journal '" + path + "' does not exist");
+            throw RuntimeError(RuntimeError::Category::NotFound,
+                               "journal '" + path + "' does not exist");
         }
         IoError(path, "open", errno);
     }
@@ -428,8 +431,9 @@ void Journal::Reset(const std::string& dir, uint64 base, bool sync) {
         UniqueFd dirFd(::open(where.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (dirFd.Get() < 0 || ::fsync(dirFd.Get()) != 0) {
             const int error = errno;
-            throw RuntimeError("journal '" + target + "': cannot sync directory '" + where +
-                               "': " + SystemErrorText(error));
+            throw RuntimeError(RuntimeError::CategoryOfErrno(error),
+                               "journal '" + target + "': cannot sync directory '" + where +
+                                   "': " + SystemErrorText(error));
         }
     }
 }
@@ -444,7 +448,8 @@ Journal::Journal(const std::string& dir, const JournalScan& scan, bool sync)
     UniqueFd fd(::open(m_path.c_str(), O_WRONLY | O_CLOEXEC));
     if (fd.Get() < 0) {
         if (errno == ENOENT) {
-            throw RuntimeError("journal '" + m_path + "' does not exist");
+            throw RuntimeError(RuntimeError::Category::NotFound,
+                               "journal '" + m_path + "' does not exist");
         }
         IoError(m_path, "open for writing", errno);
     }
@@ -454,9 +459,10 @@ Journal::Journal(const std::string& dir, const JournalScan& scan, bool sync)
     }
     const uint64 size = static_cast<uint64>(st.st_size);
     if (size < m_fileBytes) {
-        throw RuntimeError("journal '" + m_path + "' is " + std::to_string(size) +
-                           " bytes, shorter than the " + std::to_string(m_fileBytes) +
-                           " bytes it held when scanned");
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           "journal '" + m_path + "' is " + std::to_string(size) +
+                               " bytes, shorter than the " + std::to_string(m_fileBytes) +
+                               " bytes it held when scanned");
     }
     if (size > m_fileBytes) {
         // Drop the torn tail so that the next record follows the last whole one.

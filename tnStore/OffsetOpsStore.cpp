@@ -114,8 +114,9 @@ void ReplayEntry(OffsetOpsStore::Impl& s, uint64 seq, const JournalEntry& e) {
         try {
             CheckedRecord(s, Opid(e.site, e.t), e.field, e.offset);
         } catch (const RecordRefused& refused) {
-            throw RuntimeError("journal '" + JournalPath(s.dir) + "': entry " +
-                               std::to_string(seq) + " cannot be replayed: " + refused.what());
+            throw RuntimeError(RuntimeError::Category::Damaged,
+                               "journal '" + JournalPath(s.dir) + "': entry " +
+                                   std::to_string(seq) + " cannot be replayed: " + refused.what());
         }
     }
     ++s.replayed;
@@ -131,12 +132,14 @@ void FindOrCreateRecord(OffsetOpsStore::Impl& s) {
     OID oid = space.GetRoot(kRecordRoot);
     if (oid.IsNull()) {
         if (s.reader) {
-            throw RuntimeError("store '" + s.dir + "' holds no offsets record yet");
+            throw RuntimeError(RuntimeError::Category::NotFound,
+                               "store '" + s.dir + "' holds no offsets record yet");
         }
         if (std::optional<uint64> largest = s.store->LargestIdentity()) {
-            throw RuntimeError("store '" + s.dir + "' is damaged: it holds images (up to #" +
-                               std::to_string(*largest) +
-                               ") but names no offsets record; run 'offsetops validate'");
+            throw RuntimeError(RuntimeError::Category::Damaged,
+                               "store '" + s.dir + "' is damaged: it holds images (up to #" +
+                                   std::to_string(*largest) +
+                                   ") but names no offsets record; run 'offsetops validate'");
         }
         CSpaceGuard guard(space, LockMode::Exclusive);
         OffsetOps* created = CreatePersistent<OffsetOps>();
@@ -219,18 +222,20 @@ void OpenSpace(OffsetOpsStore::Impl& s, std::unique_ptr<IStore> store) {
 void RequireCheckpointInJournal(const OffsetOpsStore::Impl& s, const std::string& path,
                                 const JournalScan& scan) {
     if (s.checkpointed != scan.base && s.checkpointed != scan.end) {
-        throw RuntimeError("store '" + s.dir + "': its last checkpoint is recorded at operation " +
-                           std::to_string(s.checkpointed) + ", but journal '" + path +
-                           "' holds operations " + std::to_string(scan.base) + " to " +
-                           std::to_string(scan.end) +
-                           ": the recorded position or the journal is damaged");
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           "store '" + s.dir + "': its last checkpoint is recorded at operation " +
+                               std::to_string(s.checkpointed) + ", but journal '" + path +
+                               "' holds operations " + std::to_string(scan.base) + " to " +
+                               std::to_string(scan.end) +
+                               ": the recorded position or the journal is damaged");
     }
 }
 
 RuntimeError MissingJournal(const OffsetOpsStore::Impl& s, const std::string& path) {
-    return RuntimeError("journal '" + path + "' is missing: the store's last checkpoint covers " +
-                        std::to_string(s.checkpointed) +
-                        " operations, and any made durable after it are lost");
+    return RuntimeError(RuntimeError::Category::Damaged,
+                        "journal '" + path + "' is missing: the store's last checkpoint covers " +
+                            std::to_string(s.checkpointed) +
+                            " operations, and any made durable after it are lost");
 }
 
 // Writer: the journal after the last checkpoint, replayed; a torn tail cut.
@@ -252,9 +257,11 @@ void OpenJournalForWriting(OffsetOpsStore::Impl& s, bool legacy) {
                              [&](uint64 seq, const JournalEntry& e) { ReplayEntry(s, seq, e); });
     }
     if (scan.base > s.checkpointed) {
-        throw RuntimeError("journal '" + path + "' begins at operation " +
-                           std::to_string(scan.base) + " but the store's last checkpoint covers " +
-                           std::to_string(s.checkpointed) + ": the operations between are lost");
+        throw RuntimeError(
+            RuntimeError::Category::Damaged,
+            "journal '" + path + "' begins at operation " + std::to_string(scan.base) +
+                " but the store's last checkpoint covers " + std::to_string(s.checkpointed) +
+                ": the operations between are lost");
     }
     // Without syncs a machine crash may leave the journal behind the
     // checkpoint, which the repair below answers.
@@ -293,9 +300,10 @@ void RequireIdentitiesAhead(OffsetOpsStore::Impl& s) {
     const uint64 next = s.store->NextIdentity();
     const uint64 largest = s.store->LargestIdentity().value_or(0);
     if (largest >= next) {
-        throw RuntimeError("store '" + s.dir + "' is damaged: its identity counter " +
-                           std::to_string(next) + " is not above the stored identity #" +
-                           std::to_string(largest));
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           "store '" + s.dir + "' is damaged: its identity counter " +
+                               std::to_string(next) + " is not above the stored identity #" +
+                               std::to_string(largest));
     }
 }
 
@@ -391,7 +399,8 @@ void OffsetOpsStore::Impl::RequireOpen() const {
 void OffsetOpsStore::Impl::RequireWritable() const {
     RequireOpen();
     if (reader) {
-        throw RuntimeError("store '" + dir + "' is open for reading only");
+        throw RuntimeError(RuntimeError::Category::ReadOnly,
+                           "store '" + dir + "' is open for reading only");
     }
     if (broken) {
         throw RuntimeError("the store" + (dir.empty() ? std::string() : " '" + dir + "'") +
@@ -469,9 +478,10 @@ void OffsetOpsStore::Impl::MakeRoom() {
     const ssize_t room = OperationHeadroom(height);
     const ssize_t limit = bound - room;
     if (limit < room) {
-        throw RuntimeError("a cache of " + std::to_string(bound) +
-                           " objects is too small for a tree of height " + std::to_string(height) +
-                           ": it needs at least " + std::to_string(2 * room));
+        throw RuntimeError(
+            RuntimeError::Category::Refused,
+            "a cache of " + std::to_string(bound) + " objects is too small for a tree of height " +
+                std::to_string(height) + ": it needs at least " + std::to_string(2 * room));
     }
     if (space->NumResidents() > limit) {
         NotePeak();
@@ -585,10 +595,10 @@ OffsetOpsStore::~OffsetOpsStore() {
     }
 }
 
-OffsetOpsStore OffsetOpsStore::Open(const std::string& dir, const StoreOptions& options) {
+OffsetOpsStore OffsetOpsStore::Open(const std::filesystem::path& dir, const StoreOptions& options) {
     RegisterOffsetOpsClasses();
     auto impl = std::make_unique<Impl>();
-    impl->dir = dir;
+    impl->dir = dir.string();
     impl->options = options;
     impl->reader = options.mode == StoreMode::Read;
     if (impl->reader) {
@@ -611,7 +621,7 @@ OffsetOpsStore OffsetOpsStore::OpenInMemory(const StoreOptions& options) {
 }
 
 void OffsetOpsStore::Close() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     if (s.closed) {
         return;
     }
@@ -645,21 +655,28 @@ void OffsetOpsStore::Close() {
 }
 
 bool OffsetOpsStore::IsReader() const {
-    return m_impl->reader;
+    return Live().reader;
 }
 
-const std::string& OffsetOpsStore::Directory() const {
-    return m_impl->dir;
+std::filesystem::path OffsetOpsStore::Directory() const {
+    return Live().dir;
 }
 
 const std::vector<std::string>& OffsetOpsStore::Repairs() const {
-    return m_impl->repairs;
+    return Live().repairs;
+}
+
+OffsetOpsStore::Impl& OffsetOpsStore::Live() const {
+    if (m_impl == nullptr) {
+        throw RuntimeError("the store handle was moved from");
+    }
+    return *m_impl;
 }
 
 // --- Writing -------------------------------------------------------------------------
 
 void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset) {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireWritable();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.MakeRoom();  // a bound too small for the tree throws before anything changes
@@ -685,7 +702,7 @@ void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset
 }
 
 void OffsetOpsStore::Clear() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireWritable();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     try {
@@ -705,7 +722,7 @@ void OffsetOpsStore::Clear() {
 // caller told of the failure counts those operations as lost). Reopen the
 // store to go on.
 void OffsetOpsStore::Sync() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireWritable();
     try {
         if (s.journal != nullptr) {
@@ -723,7 +740,7 @@ void OffsetOpsStore::Sync() {
 }
 
 CompactResult OffsetOpsStore::Compact() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireWritable();
     if (s.lmdb == nullptr) {
         throw RuntimeError("an in-memory store has no file to compact");
@@ -743,10 +760,11 @@ CompactResult OffsetOpsStore::Compact() {
 
 void OffsetOpsStore::Checkpoint() {
     Sync();
+    Impl& s = Live();
     try {
-        m_impl->WriteCheckpoint();
+        s.WriteCheckpoint();
     } catch (...) {
-        m_impl->broken = true;
+        s.broken = true;
         throw;
     }
 }

@@ -7,13 +7,17 @@
 //   OffsetOpsStore store = OffsetOpsStore::Open("store");   // a directory
 //   store.Record(Opid(site, 7), FieldId(OID(Seid(uint64{42})), Path("\x01", 1)), 12);
 //   store.Sync();                                            // durable from here on
-//   std::unique_ptr<OffsetOpsOnField<int64>> table = store.Find(field);
+//   std::optional<FieldTable> table = store.Find(field);     // (site, t, o) by site
+//   for (FieldCursor c(store); !c.AtEnd(); c.Next()) { ... } // tnStore/FieldCursor.h
 //   store.Close();
 //
 // Handles. An OffsetOpsStore owns everything it opened (the object space, the
 // on-disk environment, the journal); it is movable, not copyable, and closes
-// itself when destroyed. Tables handed out (Find, the ForEach callbacks) are
-// copies or references valid for the duration of the call only.
+// itself when destroyed. A handle that was moved from holds nothing: every
+// call on it but the destructor and assignment throws RuntimeError ("the
+// store handle was moved from"). Tables handed out (Find, the ForEach
+// callbacks, cursors) are copies (FieldTable, tnStore/FieldTable.h): they
+// stay as they were when read, whatever the store does afterwards.
 //
 // Concurrency. One handle is used by one thread at a time; it is not
 // thread-safe. Across handles and processes: one writer per store directory
@@ -57,7 +61,9 @@
 //
 // Failures. Every failure is an exception derived from RuntimeError
 // (tnUtils/RuntimeError.h) whose what() is one line naming the file and what
-// is wrong: a missing, unreadable or damaged store, journal or lock file, a
+// is wrong, and whose GetCategory() says what kind of failure it is (NotFound,
+// InUse, Damaged, NoSpace, ReadOnly, Refused, Io, Other) for a program to
+// branch on: a missing, unreadable or damaged store, journal or lock file, a
 // full disk ("no space left on device"), a second writer. Record refuses an
 // operation that the record must not be given by throwing RecordRefused,
 // which names the field and the site and changes nothing; so does a cache
@@ -67,17 +73,20 @@
 // and the store on disk keeps its last durable point; reopen it to go on.
 
 #include <cstddef>
+#include <filesystem>
 #include <functional>
 #include <map>
 #include <memory>
 #include <optional>
 #include <ostream>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "tnOperation/FieldId.h"
 #include "tnOperation/src/Util/Opid.h"
-#include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
+#include "tnStore/FieldIdText.h"
+#include "tnStore/FieldTable.h"
 #include "tnUtils/RuntimeError.h"
 
 namespace tarn {
@@ -121,13 +130,18 @@ struct StoreOptions {
     double compactFreeShare = 0.25;
 };
 
-// An operation Record refused, with nothing changed.
+class FieldCursor;
+
+// An operation Record refused, with nothing changed (category Refused).
 class RecordRefused : public RuntimeError {
 public:
     enum class Reason { TimeStampOutOfRange, TimeStampOlder, SumOverflow };
 
     RecordRefused(Reason reason, const FieldId& field, const Guid& site, std::string message)
-        : RuntimeError(std::move(message)), m_reason(reason), m_field(field), m_site(site) {}
+        : RuntimeError(Category::Refused, message),
+          m_reason(reason),
+          m_field(field),
+          m_site(site) {}
 
     Reason GetReason() const { return m_reason; }
     const FieldId& Field() const { return m_field; }
@@ -188,8 +202,8 @@ struct StoreValidation {
 struct MergeConflict {
     FieldId field;
     Guid site;
-    SiteOffset<int64> ours;    // in the store merged into
-    SiteOffset<int64> theirs;  // in the store merged from
+    SiteRecord ours;    // in the store merged into (of `site`)
+    SiteRecord theirs;  // in the store merged from
 };
 
 struct MergeOptions {
@@ -238,7 +252,7 @@ struct BackupResult {
 class OffsetOpsStore {
 public:
     // Opens the store in directory `dir` (see StoreOptions::mode).
-    static OffsetOpsStore Open(const std::string& dir, const StoreOptions& options = {});
+    static OffsetOpsStore Open(const std::filesystem::path& dir, const StoreOptions& options = {});
     // A store that lives in memory only, for tests and scratch work: nothing
     // outlives the handle, Sync and Close write nothing, and Checkpoint (or a
     // cache bound) copies the changed nodes into in-memory images, from which
@@ -267,12 +281,13 @@ public:
 
     // --- Reading (any handle) ---------------------------------------------------
 
-    // A copy of the table of `field`, or null. (Tables are assigned, never
-    // copy-constructed, so the copy is handed out on the heap.)
-    std::unique_ptr<OffsetOpsOnField<int64>> Find(const FieldId& field);
+    // A copy of the table of `field`; nothing when the field has none.
+    std::optional<FieldTable> Find(const FieldId& field);
     // Calls `fn` for every field from the first not less than `from`, in key
-    // order, until it returns false.
-    using FieldVisitor = std::function<bool(const FieldId&, const OffsetOpsOnField<int64>&)>;
+    // order, until it returns false. The walk reads a few hundred fields at a
+    // time and calls `fn` between reads, so `fn` may use the store; it sees
+    // what a FieldCursor would (tnStore/FieldCursor.h).
+    using FieldVisitor = std::function<bool(const FieldId&, const FieldTable&)>;
     void ForEachFrom(const FieldId& from, const FieldVisitor& fn);
     void ForEach(const FieldVisitor& fn) { ForEachFrom(FieldId(), fn); }
     // Every field of the object `oid`, in path order.
@@ -311,7 +326,7 @@ public:
     // operation: after a crash this store holds exactly a durable point. Both
     // stores are walked in key order, the one merged from within
     // `options.cacheObjects`, this one within its own bound.
-    MergeResult Merge(const std::string& from, const MergeOptions& options = {});
+    MergeResult Merge(const std::filesystem::path& from, const MergeOptions& options = {});
 
     // Writers of on-disk stores: a checkpoint, then the data file rewritten
     // without its free pages and put in place of the old one (a rename: a
@@ -332,11 +347,11 @@ public:
     // complete (it is made in a sibling directory, synced, and renamed);
     // on failure nothing is left behind. A store that is open in this
     // process is copied with the member below.
-    static BackupResult Backup(const std::string& from, const std::string& to,
+    static BackupResult Backup(const std::filesystem::path& from, const std::filesystem::path& to,
                                const BackupOptions& options = {});
     // The same for the store of this handle (on-disk stores only); a
     // writer's operations since its last durable point are not in the copy.
-    BackupResult Backup(const std::string& to, const BackupOptions& options = {});
+    BackupResult Backup(const std::filesystem::path& to, const BackupOptions& options = {});
 
     // --- Lifetime ---------------------------------------------------------------
 
@@ -346,7 +361,7 @@ public:
     void Close();
 
     bool IsReader() const;
-    const std::string& Directory() const;  // "" for an in-memory store
+    std::filesystem::path Directory() const;  // empty for an in-memory store
     // What opening repaired (a torn journal tail dropped, a lock file made
     // anew), one line each.
     const std::vector<std::string>& Repairs() const;
@@ -358,7 +373,20 @@ public:
     struct Impl;
 
 private:
+    friend class FieldCursor;
+
+    // Where a batch of entries is read: from the first field not less than
+    // the key, after it, before it, from it back, or from the end back (the
+    // key unused).
+    enum class BatchFrom { AtOrAfter, After, Before, AtOrBefore, End };
+    using Entry = std::pair<FieldId, FieldTable>;
+    // Up to `max` entries of those `from` says, the nearest to the key (or
+    // the end) first: ascending after the key, descending before it.
+    std::vector<Entry> ReadBatch(BatchFrom from, const FieldId& key, std::size_t max);
+
     explicit OffsetOpsStore(std::unique_ptr<Impl> impl);
+    // The state of a handle that was not moved from.
+    Impl& Live() const;
     std::unique_ptr<Impl> m_impl;
 };
 

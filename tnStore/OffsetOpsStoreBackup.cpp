@@ -47,7 +47,8 @@ constexpr int kBackupAttempts = 8;
 constexpr auto kProgressInterval = std::chrono::milliseconds(200);
 
 [[noreturn]] void IoFailure(const std::string& path, const char* doing, int error) {
-    throw RuntimeError(std::string(doing) + " '" + path + "': " + SystemErrorText(error));
+    throw RuntimeError(RuntimeError::CategoryOfErrno(error),
+                       std::string(doing) + " '" + path + "': " + SystemErrorText(error));
 }
 
 void SyncPath(const std::string& path, int flags) {
@@ -64,10 +65,12 @@ void RequireFreeTarget(const fs::path& to) {
     const fs::file_status status = fs::symlink_status(to, ec);
     if (fs::exists(status)) {
         if (!fs::is_directory(status)) {
-            throw RuntimeError("backup target '" + to.string() + "' exists and is not a directory");
+            throw RuntimeError(RuntimeError::Category::Refused,
+                               "backup target '" + to.string() + "' exists and is not a directory");
         }
         if (!fs::is_empty(to, ec) || ec) {
-            throw RuntimeError("backup target '" + to.string() + "' exists and is not empty");
+            throw RuntimeError(RuntimeError::Category::Refused,
+                               "backup target '" + to.string() + "' exists and is not empty");
         }
     } else if (ec && ec != std::errc::no_such_file_or_directory) {
         throw RuntimeError("backup target '" + to.string() + "': " + ec.message());
@@ -202,12 +205,12 @@ int64 FileBytes(const fs::path& path) {
 }
 
 // A copy rewrites every message about it to name the source store.
-RuntimeError AsSourceError(const std::string& dir, const fs::path& copy, const std::string& text) {
-    std::string what = text;
+RuntimeError AsSourceError(const std::string& dir, const fs::path& copy, const RuntimeError& e) {
+    std::string what = e.what();
     for (std::size_t at; (at = what.find(copy.string())) != std::string::npos;) {
         what.replace(at, copy.string().size(), dir);
     }
-    return RuntimeError("no backup made: " + what);
+    return RuntimeError(e.GetCategory(), "no backup made: " + what);
 }
 
 // Opens the copied data file as any opening does (which makes its lock
@@ -228,20 +231,22 @@ uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
         // pages: a reader of the copy would find that image missing.
         for (uint64 oid : identities) {
             if (!copied->Load(oid)) {
-                throw RuntimeError("LMDB store '" + copy.string() + "': image #" +
-                                   std::to_string(oid) +
-                                   " is listed but cannot be looked up: its index is damaged");
+                throw RuntimeError(RuntimeError::Category::Damaged,
+                                   "LMDB store '" + copy.string() + "': image #" +
+                                       std::to_string(oid) +
+                                       " is listed but cannot be looked up: its index is damaged");
             }
         }
         for (const auto& [name, oid] : copied->Roots()) {
             if (!copied->Load(oid)) {
-                throw RuntimeError("LMDB store '" + copy.string() + "': root '" + name +
-                                   "' names #" + std::to_string(oid) + ", which has no image");
+                throw RuntimeError(RuntimeError::Category::Damaged,
+                                   "LMDB store '" + copy.string() + "': root '" + name +
+                                       "' names #" + std::to_string(oid) + ", which has no image");
             }
         }
         return copied->FindCounter(kJournalPositionCounter).value_or(0);
     } catch (const RuntimeError& e) {
-        throw AsSourceError(dir, copy, e.what());
+        throw AsSourceError(dir, copy, e);
     }
 }
 
@@ -261,11 +266,12 @@ void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
         const StoreValidation v = copied.Validate();  // LMDB's pages included
         if (!v.check.Ok()) {
             throw RuntimeError(
+                RuntimeError::Category::Damaged,
                 "store '" + copy.string() + "': " +
-                (v.check.problems.empty() ? std::string("damaged") : v.check.problems.front()));
+                    (v.check.problems.empty() ? std::string("damaged") : v.check.problems.front()));
         }
     } catch (const RuntimeError& e) {
-        throw AsSourceError(dir, copy, e.what());
+        throw AsSourceError(dir, copy, e);
     }
 }
 
@@ -325,14 +331,16 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
         target = target.parent_path();
     }
     if (target.empty() || target == "." || target == "..") {
-        throw RuntimeError("backup target '" + to + "' exists and is not empty");
+        throw RuntimeError(RuntimeError::Category::Refused,
+                           "backup target '" + to + "' exists and is not empty");
     }
     RequireFreeTarget(target);
     std::error_code ec;
     const fs::path store = fs::weakly_canonical(dir, ec);
     const fs::path inside = fs::weakly_canonical(target, ec).lexically_relative(store);
     if (!ec && !inside.empty() && *inside.begin() != "..") {
-        throw RuntimeError("backup target '" + to + "' is inside the store '" + dir + "'");
+        throw RuntimeError(RuntimeError::Category::Refused,
+                           "backup target '" + to + "' is inside the store '" + dir + "'");
     }
     PartialCopy copy(target);
     BackupResult result;
@@ -351,21 +359,21 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
 
 }  // namespace
 
-BackupResult OffsetOpsStore::Backup(const std::string& from, const std::string& to,
-                                    const BackupOptions& options) {
+BackupResult OffsetOpsStore::Backup(const std::filesystem::path& from,
+                                    const std::filesystem::path& to, const BackupOptions& options) {
     LmdbStoreOptions lmdbOptions;
     lmdbOptions.mode = OpenMode::ReadOnly;
-    std::unique_ptr<LmdbStore> lmdb = LmdbStore::Open(from, lmdbOptions);
-    return BackupWith(*lmdb, from, to, options);
+    std::unique_ptr<LmdbStore> lmdb = LmdbStore::Open(from.string(), lmdbOptions);
+    return BackupWith(*lmdb, from.string(), to.string(), options);
 }
 
-BackupResult OffsetOpsStore::Backup(const std::string& to, const BackupOptions& options) {
-    Impl& s = *m_impl;
+BackupResult OffsetOpsStore::Backup(const std::filesystem::path& to, const BackupOptions& options) {
+    Impl& s = Live();
     s.RequireOpen();
     if (s.lmdb == nullptr) {
         throw RuntimeError("an in-memory store cannot be backed up");
     }
-    return BackupWith(*s.lmdb, s.dir, to, options);
+    return BackupWith(*s.lmdb, s.dir, to.string(), options);
 }
 
 }  // namespace tarn

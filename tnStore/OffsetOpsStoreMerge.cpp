@@ -16,15 +16,9 @@ namespace tarn {
 namespace {
 
 // The record of `site` in `table`, or stamp -1 and sum 0 when it has none.
-SiteOffset<int64> RecordOf(const OffsetOpsOnField<int64>* table, const Guid& site) {
-    if (table != nullptr) {
-        const auto& sites = table->m_map.getmap();
-        auto it = sites.find(site);
-        if (it != sites.end()) {
-            return it->second;
-        }
-    }
-    return SiteOffset<int64>();
+SiteRecord RecordOf(const std::optional<FieldTable>& table, const Guid& site) {
+    const SiteRecord* found = table ? FindSite(*table, site) : nullptr;
+    return found != nullptr ? *found : SiteRecord{site, -1, 0};
 }
 
 // The next offset that moves `sum` toward `target` without overflow.
@@ -42,13 +36,15 @@ int64 StepToward(int64 sum, int64 target) {
 }  // namespace
 
 std::map<Guid, int64> OffsetOpsStore::Sites() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     return s.bounds.Newest();
 }
 
-MergeResult OffsetOpsStore::Merge(const std::string& from, const MergeOptions& options) {
-    Impl& s = *m_impl;
+MergeResult OffsetOpsStore::Merge(const std::filesystem::path& fromDir,
+                                  const MergeOptions& options) {
+    const std::string from = fromDir.string();
+    Impl& s = Live();
     if (options.dryRun) {
         s.RequireOpen();
     } else {
@@ -56,7 +52,8 @@ MergeResult OffsetOpsStore::Merge(const std::string& from, const MergeOptions& o
     }
     std::error_code ec;
     if (!s.dir.empty() && std::filesystem::equivalent(s.dir, from, ec)) {
-        throw RuntimeError("store '" + from + "' cannot be merged into itself");
+        throw RuntimeError(RuntimeError::Category::Refused,
+                           "store '" + from + "' cannot be merged into itself");
     }
     StoreOptions reading;
     reading.mode = StoreMode::Read;
@@ -65,11 +62,12 @@ MergeResult OffsetOpsStore::Merge(const std::string& from, const MergeOptions& o
 
     MergeResult result;
     int64 sinceDurable = 0;
-    source.ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& theirs) {
+    source.ForEach([&](const FieldId& field, const FieldTable& theirs) {
         ++result.fields;
-        const std::unique_ptr<OffsetOpsOnField<int64>> ours = Find(field);
-        for (const auto& [site, their] : theirs.m_map.getmap()) {
-            const SiteOffset<int64> our = RecordOf(ours.get(), site);
+        const std::optional<FieldTable> ours = Find(field);
+        for (const SiteRecord& their : theirs) {
+            const Guid& site = their.site;
+            const SiteRecord our = RecordOf(ours, site);
             if (their.t < our.t) {
                 continue;  // ours covers theirs
             }

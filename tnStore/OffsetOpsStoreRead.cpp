@@ -24,7 +24,14 @@ namespace {
 // call the store, and a bounded cache stays bounded between batches.
 constexpr std::size_t kWalkBatch = 256;
 
-using Entry = std::pair<FieldId, OffsetOpsOnField<int64>>;
+FieldTable TableOf(const OffsetOpsOnField<int64>& table) {
+    FieldTable records;
+    records.reserve(table.m_map.getmap().size());
+    for (const auto& [site, so] : table.m_map.getmap()) {
+        records.push_back(SiteRecord{site, so.t, so.o});
+    }
+    return records;
+}
 
 }  // namespace
 
@@ -44,49 +51,58 @@ StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
 void RequireSoundTree(OffsetOpsStore::Impl& s) {
     const StoreCheck check = CheckTree(s);
     if (!check.Ok()) {
-        throw RuntimeError("store '" + s.dir + "': the stored tree is damaged (" +
-                           std::to_string(check.numProblems) + " problems; the first: " +
-                           check.problems.front() + "); run 'offsetops validate' for all");
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           "store '" + s.dir + "': the stored tree is damaged (" +
+                               std::to_string(check.numProblems) + " problems; the first: " +
+                               check.problems.front() + "); run 'offsetops validate' for all");
     }
 }
 
-std::unique_ptr<OffsetOpsOnField<int64>> OffsetOpsStore::Find(const FieldId& field) {
-    Impl& s = *m_impl;
+std::optional<FieldTable> OffsetOpsStore::Find(const FieldId& field) {
+    Impl& s = Live();
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.ApplyDeferred();
     s.MakeRoom();
     const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
     if (table == nullptr) {
-        return nullptr;
+        return std::nullopt;
     }
-    auto copy = std::make_unique<OffsetOpsOnField<int64>>();
-    *copy = *table;
-    return copy;
+    return TableOf(*table);
+}
+
+// Entries are copied with the space held; the caller uses them without it,
+// so it may even call the store, and a bounded cache stays bounded between
+// batches.
+std::vector<OffsetOpsStore::Entry> OffsetOpsStore::ReadBatch(BatchFrom from, const FieldId& key,
+                                                             std::size_t max) {
+    Impl& s = Live();
+    s.RequireOpen();
+    std::vector<Entry> batch;
+    CSpaceGuard guard(*s.space, LockMode::Exclusive);
+    s.ApplyDeferred();
+    s.MakeRoom();
+    const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
+    if (from == BatchFrom::AtOrAfter || from == BatchFrom::After) {
+        auto it = from == BatchFrom::AtOrAfter ? map.lower_bound(key) : map.upper_bound(key);
+        for (; it != map.end() && batch.size() < max; ++it) {
+            batch.emplace_back(it->first, TableOf(it->second));
+        }
+        return batch;
+    }
+    auto it = from == BatchFrom::Before       ? map.lower_bound(key)
+              : from == BatchFrom::AtOrBefore ? map.upper_bound(key)
+                                              : map.end();
+    while (it != map.begin() && batch.size() < max) {
+        --it;
+        batch.emplace_back(it->first, TableOf(it->second));
+    }
+    return batch;
 }
 
 void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
-    Impl& s = *m_impl;
-    s.RequireOpen();
-    // A deque, since a table can be assigned but not copy-constructed into
-    // a growing vector.
-    std::deque<Entry> batch;
-    FieldId key = from;
-    bool inclusive = true;
+    std::vector<Entry> batch = ReadBatch(BatchFrom::AtOrAfter, from, kWalkBatch);
     for (;;) {
-        batch.clear();
-        {
-            CSpaceGuard guard(*s.space, LockMode::Exclusive);
-            s.ApplyDeferred();
-            s.MakeRoom();
-            const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
-            auto it = inclusive ? map.lower_bound(key) : map.upper_bound(key);
-            for (; it != map.end() && batch.size() < kWalkBatch; ++it) {
-                batch.emplace_back(std::piecewise_construct, std::forward_as_tuple(it->first),
-                                   std::forward_as_tuple());
-                batch.back().second = it->second;
-            }
-        }
         for (const Entry& e : batch) {
             if (!fn(e.first, e.second)) {
                 return;
@@ -95,19 +111,19 @@ void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
         if (batch.size() < kWalkBatch) {
             return;
         }
-        key = batch.back().first;
-        inclusive = false;
+        const FieldId last = batch.back().first;
+        batch = ReadBatch(BatchFrom::After, last, kWalkBatch);
     }
 }
 
 void OffsetOpsStore::ForEachOfObject(OID oid, const FieldVisitor& fn) {
-    ForEachFrom(FieldId(oid, Path()), [&](const FieldId& field, const OffsetOpsOnField<int64>& t) {
+    ForEachFrom(FieldId(oid, Path()), [&](const FieldId& field, const FieldTable& t) {
         return field.oid == oid && fn(field, t);
     });
 }
 
 int64 OffsetOpsStore::Size() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.ApplyDeferred();
@@ -115,7 +131,7 @@ int64 OffsetOpsStore::Size() {
 }
 
 ssize_t OffsetOpsStore::Height() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.ApplyDeferred();
@@ -123,7 +139,7 @@ ssize_t OffsetOpsStore::Height() {
 }
 
 StoreStatistics OffsetOpsStore::Stats() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     StoreStatistics stats;
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
@@ -150,7 +166,7 @@ StoreStatistics OffsetOpsStore::Stats() {
 }
 
 StoreCheck OffsetOpsStore::Check() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.ApplyDeferred();
@@ -194,7 +210,7 @@ void CompareKeptCounts(OffsetOpsStore::Impl& s,
 // Within a cache bound the map's own validation is left out: it holds the
 // whole tree in memory, and the check above covers its invariants.
 StoreValidation OffsetOpsStore::Validate() {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     StoreValidation v;
     const ssize_t bound = s.options.cacheObjects;
@@ -255,7 +271,7 @@ StoreValidation OffsetOpsStore::Validate() {
 }
 
 void OffsetOpsStore::Dump(std::ostream& out) {
-    Impl& s = *m_impl;
+    Impl& s = Live();
     s.RequireOpen();
     CSpaceGuard guard(*s.space, LockMode::Exclusive);
     s.ApplyDeferred();

@@ -21,7 +21,8 @@ constexpr ssize_t kMinEntries = FieldIdToOffsetOpsOnInt64FieldMapMinEntries;
 constexpr ssize_t kMaxHeight = 64;
 
 [[noreturn]] void Damaged(OID oid, const std::string& what) {
-    throw RuntimeError("damaged tree: node " + ToString(oid) + " " + what);
+    throw RuntimeError(RuntimeError::Category::Damaged,
+                       "damaged tree: node " + ToString(oid) + " " + what);
 }
 
 // A node of either class, read through one interface. Slot s of an internal

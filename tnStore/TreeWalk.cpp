@@ -15,8 +15,9 @@ using InternalNode = Map::InternalNode;
 
 uint64 Child(const prefbase& ref, uint64 parent) {
     if (ref.m_oid.IsNull()) {
-        throw RuntimeError("damaged tree: internal node #" + std::to_string(parent) +
-                           " has a missing child reference");
+        throw RuntimeError(RuntimeError::Category::Damaged, "damaged tree: internal node #" +
+                                                                std::to_string(parent) +
+                                                                " has a missing child reference");
     }
     return ref.m_oid.value_;
 }

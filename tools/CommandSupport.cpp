@@ -1,6 +1,10 @@
 #include "tools/CommandSupport.h"
 
+#include <algorithm>
+#include <filesystem>
 #include <iomanip>
+
+#include "tools/Output.h"
 
 namespace tarn::tool {
 
@@ -13,11 +17,27 @@ void Row(std::ostream& out, const char* label, const std::string& value) {
     out << std::left << std::setw(22) << label << value << '\n';
 }
 
+std::string NodesText(const StoreStatistics& stats) {
+    return std::to_string(stats.Nodes()) + " (" + std::to_string(stats.leaves) + " leaves, " +
+           std::to_string(stats.internalNodes) + " internal)";
+}
+
+void RequireStore(const std::string& dir) {
+    std::error_code ec;
+    if (!std::filesystem::exists(dir, ec) && !ec) {
+        throw RuntimeError(RuntimeError::Category::NotFound,
+                           "store '" + dir + "' does not exist; 'offsetops record' creates stores");
+    }
+}
+
 OffsetOpsStore OpenAndReport(const std::string& dir, const StoreOptions& options,
                              std::ostream& err) {
+    if (options.mode != StoreMode::Write) {
+        RequireStore(dir);
+    }
     OffsetOpsStore store = OffsetOpsStore::Open(dir, options);
     for (const std::string& repair : store.Repairs()) {
-        err << "offsetops: " << dir << ": repaired: " << repair << '\n';
+        err << "offsetops: store '" << dir << "': repaired: " << repair << '\n';
     }
     return store;
 }
@@ -32,9 +52,10 @@ void RequireSoundTree(OffsetOpsStore& store) {
     const StoreCheck check = store.Check();
     if (!check.Ok()) {
         throw RuntimeError(
-            "the stored tree is damaged (" + std::to_string(check.numProblems) +
-            " problems; the first: " + (check.problems.empty() ? "?" : check.problems.front()) +
-            "); run 'offsetops validate' for all");
+            RuntimeError::Category::Damaged,
+            "the stored tree is damaged (" + Counted(check.numProblems, "problem", "problems") +
+                "; the first: " + (check.problems.empty() ? "?" : check.problems.front()) +
+                "); run 'offsetops validate' for all");
     }
 }
 
@@ -61,8 +82,30 @@ std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheO
     }
     // A walk that stops at once loads the path to the first leaf: damage on
     // it is reported before anything is written.
-    store.ForEach([](const FieldId&, const OffsetOpsOnField<int64>&) { return false; });
+    store.ForEach([](const FieldId&, const FieldTable&) { return false; });
     return store;
+}
+
+std::string ShellWord(const std::string& text) {
+    const bool plain = !text.empty() && std::all_of(text.begin(), text.end(), [](char c) {
+        return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+               std::string_view("_./-+,=:@%").find(c) != std::string_view::npos;
+    });
+    if (plain) {
+        return text;
+    }
+    std::string quoted = "'";
+    for (const char c : text) {
+        quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
+    }
+    return quoted + "'";
+}
+
+int OutputFailed(std::ostream& err, int status) {
+    if (!StandardOutputClosed()) {
+        Fail(err, "cannot write the output (a full disk?)");
+    }
+    return status;
 }
 
 }  // namespace tarn::tool

@@ -1,8 +1,9 @@
 #pragma once
 
-// What the subcommands of `offsetops` share: messages, opening a store, and
+// What the commands of `offsetops` share: messages, opening a store, and
 // the walks of the streaming commands.
 
+#include <optional>
 #include <ostream>
 #include <string>
 
@@ -16,7 +17,16 @@ int Fail(std::ostream& err, const std::string& message);
 // "label                 value", the rows of the summaries.
 void Row(std::ostream& out, const char* label, const std::string& value);
 
-// Opens the store and says on `err` what opening repaired.
+// "12 (10 leaves, 2 internal)".
+std::string NodesText(const StoreStatistics& stats);
+
+// Throws RuntimeError (NotFound) when nothing is at `dir`, saying so in the
+// program's words.
+void RequireStore(const std::string& dir);
+
+// Opens the store and says on `err` what opening repaired. A store that is
+// not there (for any mode but Write, which creates it) is a RuntimeError
+// that says so in the program's words.
 OffsetOpsStore OpenAndReport(const std::string& dir, const StoreOptions& options,
                              std::ostream& err);
 OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostream& err);
@@ -36,5 +46,14 @@ std::string CacheTooSmall(ssize_t bound, ssize_t height);
 // having said why on `err`, when the bound is too small for the tree.
 std::optional<OffsetOpsStore> OpenForWalk(const std::string& dir, ssize_t cacheObjects,
                                           std::ostream& err);
+
+// `text` as one word of a shell command line: as it is when it needs no
+// quoting, in single quotes otherwise.
+std::string ShellWord(const std::string& text);
+
+// Reports that writing the results failed: nothing when standard output is
+// a closed pipe (the program then ends quietly), a message otherwise.
+// Returns `status`.
+int OutputFailed(std::ostream& err, int status);
 
 }  // namespace tarn::tool

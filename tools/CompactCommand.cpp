@@ -17,18 +17,34 @@ std::string MiBText(int64 bytes) {
 
 }  // namespace
 
-int RunCompact(const std::string& store, std::ostream& out, std::ostream& err) {
-    OffsetOpsStore opened = OpenAndReport(store, StoreMode::WriteExisting, err);
+namespace {
+
+int RunCompact(const Arguments& args, Io& io) {
+    const std::string store = args.Store();
+    OffsetOpsStore opened = OpenAndReport(store, StoreMode::WriteExisting, io.err);
     const CompactResult result = opened.Compact();
     opened.Close();
     if (!result.compacted) {
-        return Fail(err, "store '" + store +
-                             "' was not compacted: another process has it open (a reader); "
-                             "try again when it has closed");
+        return Fail(io.err, "store '" + store +
+                                "' was not compacted: another process has it open (a reader); "
+                                "try again when it has closed");
     }
-    out << "compacted '" << store << "': " << MiBText(result.bytesBefore) << " -> "
-        << MiBText(result.bytesAfter) << '\n';
+    io.out << "compacted '" << store << "': " << MiBText(result.bytesBefore) << " -> "
+           << MiBText(result.bytesAfter) << '\n';
     return 0;
+}
+
+}  // namespace
+
+CommandSpec CompactCommand() {
+    return {
+        "compact",
+        "--store DIR",
+        "rewrite the data file without its free pages (no other process may have the store "
+        "open)",
+        {StoreOption()},
+        RunCompact,
+    };
 }
 
 }  // namespace tarn::tool

@@ -10,6 +10,7 @@
 
 #include "tools/CommandSupport.h"
 #include "tools/Commands.h"
+#include "tools/Interrupt.h"
 #include "tools/OpsFile.h"
 #include "tools/Progress.h"
 
@@ -19,15 +20,21 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// The export file while it is written: a sibling under a temporary name,
-// renamed to the file's name once complete, removed otherwise.
+constexpr const char* kPartialSuffix = ".partial-";
+
+// The export file while it is written: a sibling under a name of its own
+// (FILE.partial-PID), renamed to the file's name once complete, removed
+// otherwise. Messages name the file the user asked for.
 class ExportFile {
 public:
     explicit ExportFile(const std::string& path)
-        : m_path(path), m_temp(path + ".partial-" + std::to_string(::getpid())) {
+        : m_path(path), m_temp(path + kPartialSuffix + std::to_string(::getpid())) {
+        RemoveStalePartials(path, "", kPartialSuffix);
         m_stream.open(m_temp, std::ios::out | std::ios::trunc);
         if (!m_stream) {
-            throw RuntimeError("cannot write '" + m_temp + "': " + std::strerror(errno));
+            const int error = errno;
+            throw RuntimeError(RuntimeError::CategoryOfErrno(error),
+                               "cannot write '" + m_path + "': " + std::strerror(error));
         }
     }
     ~ExportFile() {
@@ -47,23 +54,26 @@ public:
         const bool written = static_cast<bool>(m_stream);
         m_stream.close();
         if (!written || m_stream.fail()) {
-            throw RuntimeError("writing '" + m_temp + "' failed" + WhyNoSpace());
+            const bool full = NoSpace();
+            throw RuntimeError(
+                full ? RuntimeError::Category::NoSpace : RuntimeError::Category::Io,
+                "writing '" + m_path + "' failed" + (full ? ": no space left on device" : ""));
         }
         if (std::rename(m_temp.c_str(), m_path.c_str()) != 0) {
-            throw RuntimeError("cannot rename '" + m_temp + "' to '" + m_path +
-                               "': " + std::strerror(errno));
+            const int error = errno;
+            throw RuntimeError(RuntimeError::CategoryOfErrno(error),
+                               "cannot write '" + m_path + "': " + std::strerror(error));
         }
         m_done = true;
     }
 
 private:
     // Streams do not say why a write failed; a full disk is the usual cause.
-    std::string WhyNoSpace() const {
+    bool NoSpace() const {
         std::error_code ec;
-        const fs::space_info space = fs::space(
-            fs::path(m_temp).parent_path().empty() ? fs::path(".") : fs::path(m_temp).parent_path(),
-            ec);
-        return !ec && space.available < (uint64{1} << 20) ? ": no space left on device" : "";
+        const fs::path parent = fs::path(m_temp).parent_path();
+        const fs::space_info space = fs::space(parent.empty() ? fs::path(".") : parent, ec);
+        return !ec && space.available < (uint64{1} << 20);
     }
 
     std::string m_path;
@@ -72,33 +82,41 @@ private:
     bool m_done = false;
 };
 
-}  // namespace
-
-int RunExport(const std::string& store, const std::string& outFile, const WalkSettings& settings,
-              std::ostream& out, std::ostream& err) {
-    std::optional<OffsetOpsStore> opened = OpenForWalk(store, settings.cacheObjects, err);
-    if (!opened) {
-        return 2;
+int RunExport(const Arguments& args, Io& io) {
+    CatchStopSignals();
+    const std::string dir = args.Store();
+    const std::string outFile = args.Text("--out").value_or("");
+    if (args.Has("--out") && outFile.empty()) {
+        throw UsageError{"--out needs a file name, or '-' for standard output"};
+    }
+    const ssize_t cacheObjects = args.CacheNodes(kDefaultWalkCacheObjects);
+    const bool progressWanted = args.Progress();
+    std::optional<OffsetOpsStore> store = OpenForWalk(dir, cacheObjects, io.err);
+    if (!store) {
+        return kUsageStatus;
     }
     std::optional<ExportFile> file;
     if (!outFile.empty() && outFile != "-") {
         file.emplace(outFile);
     }
-    std::ostream& sink = file ? file->Stream() : out;
-    const int64 fields = opened->Size();
-    sink << "# offsetops export of store '" << store << "': " << fields
-         << " fields, a line per site of each: site,t,oid,path,offset; 'offsetops record "
+    std::ostream& sink = file ? file->Stream() : io.out;
+    const int64 fields = store->Size();
+    sink << "# offsetops export of store '" << dir << "': " << Counted(fields, "field", "fields")
+         << ", a line per site of each: site,t,oid,path,offset; 'offsetops record "
             "--ops FILE' loads it into an empty store\n";
 
-    ProgressLine progress(settings.progress, err, "export");
+    ProgressLine progress(progressWanted, io.err, "export");
     int64 done = 0;
     OffsetOperation op;
-    opened->ForEach([&](const FieldId& field, const OffsetOpsOnField<int64>& table) {
+    store->ForEach([&](const FieldId& field, const FieldTable& table) {
+        if (StopSignal() != 0) {
+            return false;
+        }
         op.field = field;
-        for (const auto& [site, so] : table.m_map.getmap()) {
-            op.site = site;
-            op.t = so.t;
-            op.offset = so.o;
+        for (const SiteRecord& r : table) {
+            op.site = r.site;
+            op.t = r.t;
+            op.offset = r.o;
             sink << FormatOpsLine(op) << '\n';
         }
         ++done;
@@ -109,13 +127,40 @@ int RunExport(const std::string& store, const std::string& outFile, const WalkSe
         return static_cast<bool>(sink);
     });
     progress.Finish();
+    if (const int signal = StopSignal()) {
+        file.reset();  // removes what was written
+        Fail(io.err,
+             "export stopped by " + SignalName(signal) +
+                 (outFile.empty() || outFile == "-" ? std::string()
+                                                    : "; '" + outFile + "' was not written"));
+        return StoppedStatus(signal);
+    }
     if (file) {
         file->Finish();
-        err << "offsetops: exported " << done << " fields to '" << outFile << "'\n";
+        io.err << "offsetops: exported " << Counted(done, "field", "fields") << " to '" << outFile
+               << "'\n";
     } else if (!sink.flush()) {
-        return Fail(err, "writing the export failed");
+        return OutputFailed(io.err, kFailed);
     }
     return 0;
+}
+
+}  // namespace
+
+CommandSpec ExportCommand() {
+    return {
+        "export",
+        "--store DIR [--out FILE] [--cache-nodes C] [--no-progress]",
+        "print every table as ops lines, which 'record --ops' loads back",
+        {
+            StoreOption(),
+            {"--out", "FILE",
+             "write to FILE (made as FILE.partial-PID, then renamed) instead of standard output"},
+            CacheOption(),
+            NoProgressOption(),
+        },
+        RunExport,
+    };
 }
 
 }  // namespace tarn::tool

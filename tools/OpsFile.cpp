@@ -3,8 +3,7 @@
 #include <charconv>
 #include <vector>
 
-#include "tnUtils/Hex.h"
-#include "tnUtils/xostream.h"
+#include "tnStore/FieldIdText.h"
 
 namespace tarn::tool {
 
@@ -62,51 +61,6 @@ bool ParseTimeStamp(std::string_view s, int64& t, std::string& error) {
     return true;
 }
 
-bool ParseOid(std::string_view s, uint64& oid, std::string& error) {
-    if (s.empty()) {
-        error = "the oid is missing";
-        return false;
-    }
-    if (s[0] == '-' || s[0] == '+') {
-        error = "oid " + Quoted(s) + " is not an unsigned decimal integer";
-        return false;
-    }
-    std::errc ec = ParseDecimal(s, oid);
-    if (ec == std::errc::invalid_argument) {
-        error = "oid " + Quoted(s) + " is not an unsigned decimal integer";
-        return false;
-    }
-    if (ec == std::errc::result_out_of_range) {
-        error = "oid " + std::string(s) + " does not fit in 64 bits";
-        return false;
-    }
-    if (oid == 0) {
-        error = "oid 0 names no object (identities start at 1)";
-        return false;
-    }
-    return true;
-}
-
-bool ParsePath(std::string_view s, Path& path, std::string& error) {
-    if (s.size() % 2 != 0) {
-        error = "path " + Quoted(s) + " has an odd number of hex digits";
-        return false;
-    }
-    std::vector<octet_t> bytes;
-    bytes.reserve(s.size() / 2);
-    for (std::size_t i = 0; i < s.size(); i += 2) {
-        int hi = HexDigitValue(s[i]);
-        int lo = HexDigitValue(s[i + 1]);
-        if (hi < 0 || lo < 0) {
-            error = "path " + Quoted(s) + " is not hex (two hex digits a byte)";
-            return false;
-        }
-        bytes.push_back(static_cast<octet_t>(hi * 16 + lo));
-    }
-    path = Path(bytes.data(), static_cast<ssize_t>(bytes.size()));
-    return true;
-}
-
 bool ParseOffset(std::string_view s, int64& offset, std::string& error) {
     if (s.empty()) {
         error = "the offset is missing";
@@ -127,13 +81,9 @@ bool ParseOffset(std::string_view s, int64& offset, std::string& error) {
 }  // namespace
 
 std::string FormatOpsLine(const OffsetOperation& op) {
-    StringOutputStream path;
-    {
-        xostream os(path);
-        os << op.field.path;
-    }
     return ToString(op.site) + "," + std::to_string(op.t) + "," +
-           std::to_string(op.field.oid.value_) + "," + path.str() + "," + std::to_string(op.offset);
+           std::to_string(op.field.oid.value_) + "," + PathHex(op.field.path) + "," +
+           std::to_string(op.offset);
 }
 
 ParsedLine ParseOpsLine(std::string_view line) {
@@ -166,42 +116,33 @@ ParsedLine ParseOpsLine(std::string_view line) {
     }
     OffsetOperation& op = parsed.op;
     op.site = *site;
-    uint64 oid = 0;
-    Path path;
-    if (!ParseTimeStamp(fields[1], op.t, parsed.error) || !ParseOid(fields[2], oid, parsed.error) ||
-        !ParsePath(fields[3], path, parsed.error) ||
-        !ParseOffset(fields[4], op.offset, parsed.error)) {
+    if (!ParseTimeStamp(fields[1], op.t, parsed.error)) {
         return parsed;
     }
-    op.field = FieldId(OID(Seid(oid)), path);
+    const std::optional<OID> oid = ParseOid(fields[2], &parsed.error);
+    const std::optional<Path> path = oid ? ParsePathHex(fields[3], &parsed.error) : std::nullopt;
+    if (!path || !ParseOffset(fields[4], op.offset, parsed.error)) {
+        return parsed;
+    }
+    op.field = FieldId(*oid, *path);
     parsed.kind = ParsedLine::Kind::Operation;
     return parsed;
 }
 
-std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error) {
-    std::string message;
-    std::string_view s = Trim(text);
-    if (!s.empty() && s[0] == '#') {
-        s.remove_prefix(1);
+int64 OpsFileReader::Skip(int64 lines) {
+    int64 skipped = 0;
+    for (; skipped < lines && std::getline(m_in, m_buffer); ++skipped) {
+        ++m_line;
+        m_complete = !m_in.eof();
+        m_bytes += m_buffer.size() + 1;
     }
-    std::size_t slash = s.find('/');
-    std::string_view oidText = s.substr(0, slash);
-    std::string_view pathText = slash == std::string_view::npos ? "" : s.substr(slash + 1);
-    uint64 oid = 0;
-    Path path;
-    if (!ParseOid(oidText, oid, message) || !ParsePath(pathText, path, message)) {
-        if (error != nullptr) {
-            *error =
-                "field " + Quoted(text) + ": " + message + " (expected OID/PATH, e.g. #12/0a0b)";
-        }
-        return std::nullopt;
-    }
-    return FieldId(OID(Seid(oid)), path);
+    return skipped;
 }
 
 OpsFileReader::Status OpsFileReader::Next(OffsetOperation& op, std::string& error) {
     while (std::getline(m_in, m_buffer)) {
         ++m_line;
+        m_complete = !m_in.eof();
         m_bytes += m_buffer.size() + 1;
         std::string_view line = m_buffer;
         if (m_line == 1 && line.starts_with(kByteOrderMark)) {

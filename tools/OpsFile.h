@@ -54,11 +54,6 @@ struct ParsedLine {
 
 ParsedLine ParseOpsLine(std::string_view line);
 
-// A field key in the text form of FieldId ("#12/0a0b"): an optional '#', the
-// decimal identity, then '/' and the path in hex. "12" alone means the empty
-// path. Nothing, with a message in `error`, when the text is not one.
-std::optional<FieldId> ParseFieldId(std::string_view text, std::string* error);
-
 // Reads operations from a stream line by line, skipping blanks and comments.
 // Not thread-safe; owns nothing but its line buffer.
 class OpsFileReader {
@@ -70,6 +65,14 @@ public:
     // The next operation into `op`; on Error, `error` says what is wrong with
     // line LineNumber(). After End or Error, do not call again.
     Status Next(OffsetOperation& op, std::string& error);
+
+    // Passes over the next `lines` lines, whatever they hold; returns how
+    // many there were (fewer at the end of the input).
+    int64 Skip(int64 lines);
+
+    // Whether the line read last ended in a line break (or was the file's
+    // last line): false for one cut short by the input's end.
+    bool LastLineComplete() const { return m_complete; }
 
     // The number of the line read last (1 for the first line).
     int64 LineNumber() const { return m_line; }
@@ -83,6 +86,7 @@ private:
     std::string m_buffer;
     int64 m_line = 0;
     uint64 m_bytes = 0;
+    bool m_complete = true;
 };
 
 }  // namespace tarn::tool

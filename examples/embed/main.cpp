@@ -1,10 +1,13 @@
 // Records three offset operations into a store directory, makes them
-// durable, and prints the table of one field and every field in key order.
+// durable, and prints the table of one field, then every field in key order
+// with a cursor, then the same backwards.
 //
 //   embed-example STORE_DIR
 
+#include <filesystem>
 #include <iostream>
 
+#include "tnStore/FieldCursor.h"
 #include "tnStore/OffsetOpsStore.h"
 
 int main(int argc, char** argv) {
@@ -14,31 +17,35 @@ int main(int argc, char** argv) {
         return 2;
     }
     try {
-        OffsetOpsStore store = OffsetOpsStore::Open(argv[1]);
+        OffsetOpsStore store = OffsetOpsStore::Open(std::filesystem::path(argv[1]));
         const Guid site = *ParseGuid("0123abcd-0001-beef-8000-00000000002a");
-        const FieldId field(OID(Seid(uint64{42})), Path("\x01", 1));
+        const FieldId field = *ParseFieldId("#42/01");
         store.Record(Opid(site, 7), field, 12);
         store.Record(Opid(site, 8), field, -5);
-        store.Record(Opid(site, 8), FieldId(OID(Seid(uint64{43})), Path()), 1);
+        store.Record(Opid(site, 8), *ParseFieldId("#43/"), 1);
         store.Sync();  // durable from here on
 
-        if (auto table = store.Find(field)) {
-            for (const auto& [s, so] : table->m_map.getmap()) {
-                std::cout << ToString(field) << " " << ToString(s) << " t=" << so.t << " o=" << so.o
-                          << '\n';
+        if (std::optional<FieldTable> table = store.Find(field)) {
+            for (const SiteRecord& r : *table) {
+                std::cout << ToString(field) << " " << ToString(r.site) << " t=" << r.t
+                          << " o=" << r.o << '\n';
             }
         }
-        store.ForEach([](const FieldId& f, const OffsetOpsOnField<int64>& table) {
-            std::cout << ToString(f) << ": " << table.m_map.getmap().size() << " sites\n";
-            return true;
-        });
+        for (FieldCursor c(store); !c.AtEnd(); c.Next()) {
+            std::cout << ToString(c.Key()) << " --> " << ToString(c.Table()) << '\n';
+        }
+        FieldCursor back(store);
+        for (back.SeekToLast(); !back.AtEnd(); back.Prev()) {
+            std::cout << "back: " << ToString(back.Key()) << '\n';
+        }
         store.Close();
     } catch (const RecordRefused& e) {
         std::cerr << "refused: " << e.what() << '\n';
         return 1;
     } catch (const RuntimeError& e) {
-        std::cerr << "error: " << e.what() << '\n';
-        return 1;
+        // A second writer is InUse, a damaged file Damaged, a full disk NoSpace.
+        std::cerr << "error (" << CategoryName(e.GetCategory()) << "): " << e.what() << '\n';
+        return e.GetCategory() == RuntimeError::Category::InUse ? 3 : 1;
     }
     return 0;
 }

@@ -1,11 +1,10 @@
-// Assigns an object's address to an untyped persistent reference, which
-// only takes null: the reference's header stops the program.
+// Asks a cursor standing at the end of an empty store for its key, a misuse
+// that the cursor's installed header stops the program for.
 
-#include "tnPersistStore/pref.h"
+#include "tnStore/FieldCursor.h"
 
 int main() {
-    int object = 0;
-    tarn::cref<void> ref;
-    ref = static_cast<void*>(&object);
-    return 0;
+    tarn::OffsetOpsStore store = tarn::OffsetOpsStore::OpenInMemory();
+    tarn::FieldCursor cursor(store);
+    return cursor.Key().oid.IsNull() ? 0 : 1;
 }
