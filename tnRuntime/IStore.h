@@ -43,10 +43,10 @@ struct CommitBatch {
     // transaction calls it again) and must give the same images each time;
     // each identity at most once, and none also in `writes`.
     std::function<void(const ImageSink&)> streamedWrites;
-    std::vector<uint64> deletes;                         // identities to remove
-    std::map<std::string, uint64> roots;                 // named roots to set
-    std::map<std::string, uint64> counters;              // named counters to set
-    uint64 nextIdentity = 1;                             // the identity counter
+    std::vector<uint64> deletes;             // identities to remove
+    std::map<std::string, uint64> roots;     // named roots to set
+    std::map<std::string, uint64> counters;  // named counters to set
+    uint64 nextIdentity = 1;                 // the identity counter
 };
 
 struct StoreStats {
