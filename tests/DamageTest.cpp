@@ -423,21 +423,23 @@ TEST(DamageCampaign, DamagedCopiesKeepADurablePointOrEndWithOneErrorLine) {
     });
 }
 
-// Random seeds for TARN_DAMAGE_SOAK_SECONDS seconds (scripts/soak); skipped
-// otherwise, so that the test command stays the same run every time.
-TEST(DamageSoak, RandomSeedsForAsLongAsAsked) {
-    const char* text = std::getenv("TARN_DAMAGE_SOAK_SECONDS");
-    if (text == nullptr) {
-        GTEST_SKIP() << "set TARN_DAMAGE_SOAK_SECONDS (scripts/soak) for a soak run";
+// A soak run (scripts/soak): consecutive seeds from TARN_DAMAGE_SOAK_FIRST_SEED,
+// which the script draws at random, for TARN_DAMAGE_SOAK_SECONDS seconds.
+// Skipped otherwise, so that the test command is the same run every time.
+TEST(DamageSoak, ConsecutiveSeedsForAsLongAsAsked) {
+    const char* seconds = std::getenv("TARN_DAMAGE_SOAK_SECONDS");
+    const char* first = std::getenv("TARN_DAMAGE_SOAK_FIRST_SEED");
+    if (seconds == nullptr || first == nullptr) {
+        GTEST_SKIP() << "run scripts/soak for a soak run";
     }
     const auto until =
-        std::chrono::steady_clock::now() + std::chrono::seconds(std::strtoll(text, nullptr, 10));
-    std::random_device device;
+        std::chrono::steady_clock::now() + std::chrono::seconds(std::strtoll(seconds, nullptr, 10));
+    uint64 seed = std::strtoull(first, nullptr, 10);
     RunDamageCampaign([&]() -> std::optional<uint64> {
         if (std::chrono::steady_clock::now() >= until) {
             return std::nullopt;
         }
-        return (uint64{device()} << 32) | device();
+        return seed++;
     });
 }
 

@@ -2,6 +2,7 @@
 // through the journal, readers beside a writer, the cache bound.
 
 #include "tests/StoreTables.h"
+#include "tests/StoreTestDir.h"
 #include "tnStore/OffsetOpsStore.h"
 
 #include "tnStore/Journal.h"
@@ -21,31 +22,14 @@ namespace {
 namespace fs = std::filesystem;
 using ::testing::HasSubstr;
 
-Guid Site(uint32 n) {
-    Guid g{};
-    g.Data1 = n;
-    return g;
-}
+using storetest::Site;
 
 FieldId Field(uint64 oid, std::string_view path = "\x01") {
     return FieldId(OID(Seid(oid)), Path(path.data(), static_cast<ssize_t>(path.size())));
 }
 
-class StoreDir : public ::testing::Test {
+class StoreDir : public storetest::StoreDirTest {
 protected:
-    void SetUp() override {
-        m_dir = ::testing::TempDir() + "/api-" + std::to_string(::getpid()) + "-" +
-                ::testing::UnitTest::GetInstance()->current_test_info()->name();
-        fs::remove_all(m_dir);
-    }
-    void TearDown() override { fs::remove_all(m_dir); }
-
-    StoreOptions Reading() const {
-        StoreOptions options;
-        options.mode = StoreMode::Read;
-        return options;
-    }
-
     // Runs `body` with a writer in a child process that ends without closing
     // (as a crash would), and waits for it.
     template <class Body>
@@ -62,8 +46,6 @@ protected:
         ASSERT_EQ(::waitpid(pid, &status, 0), pid);
         ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
     }
-
-    std::string m_dir;
 };
 
 TEST(OffsetOpsStoreMemory, RecordsFindsAndWalksInKeyOrder) {

@@ -11,6 +11,7 @@
 #include <map>
 #include <random>
 
+#include "tests/StoreTestDir.h"
 #include "tnStore/FieldCursor.h"
 #include "tnStore/OffsetOpsStore.h"
 
@@ -21,11 +22,7 @@ namespace fs = std::filesystem;
 using ::testing::HasSubstr;
 using Category = RuntimeError::Category;
 
-Guid Site(uint32 n) {
-    Guid g{};
-    g.Data1 = n;
-    return g;
-}
+using storetest::Site;
 
 FieldId Field(uint64 oid, std::string_view path = "") {
     return FieldId(OID(Seid(oid)), Path(path.data(), static_cast<ssize_t>(path.size())));

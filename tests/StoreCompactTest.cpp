@@ -9,6 +9,7 @@
 #include <filesystem>
 
 #include "tests/StoreTables.h"
+#include "tests/StoreTestDir.h"
 #include "tnStore/OffsetOpsStore.h"
 
 namespace tarn {
@@ -16,25 +17,14 @@ namespace {
 
 namespace fs = std::filesystem;
 
-Guid Site(uint32 n) {
-    Guid g{};
-    g.Data1 = n;
-    return g;
-}
+using storetest::Site;
 
 FieldId Field(uint64 n) {
     return FieldId(OID(Seid(1 + n)), Path("\x02", 1));
 }
 
-class StoreCompact : public ::testing::Test {
+class StoreCompact : public storetest::StoreDirTest {
 protected:
-    void SetUp() override {
-        m_dir = ::testing::TempDir() + "/compact-" + std::to_string(::getpid()) + "-" +
-                ::testing::UnitTest::GetInstance()->current_test_info()->name();
-        fs::remove_all(m_dir);
-    }
-    void TearDown() override { fs::remove_all(m_dir); }
-
     // Rounds over every field, each checkpointed: every checkpoint rewrites
     // the whole tree on new pages. Returns the tables.
     Tables Fill(OffsetOpsStore& store, int rounds, int first = 0) {
@@ -48,8 +38,6 @@ protected:
     }
 
     int64 FileBytes() const { return static_cast<int64>(fs::file_size(m_dir + "/data.mdb")); }
-
-    std::string m_dir;
 };
 
 // Closing a store whose checkpoints left more free pages than the share

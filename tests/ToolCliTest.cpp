@@ -205,12 +205,12 @@ TEST(ToolCommandLine, VersionHelpAndSuggestionsForNearMisses) {
     EXPECT_EQ(RunOk({"--version"}), std::string("offsetops ") + OFFSETOPS_VERSION + "\n");
     const std::string help = RunOk({"help"});
     EXPECT_EQ(RunOk({"--help"}), help);
-    for (const tool::CommandSpec& command : tool::Commands()) {
+    for (const tool::CommandDecl& command : tool::Commands()) {
         EXPECT_THAT(help, HasSubstr("\n  " + command.name + " ")) << command.name;
         const std::string commandHelp = RunOk({"help", command.name});
         EXPECT_THAT(commandHelp, StartsWith("Usage: offsetops " + command.name + " "));
         EXPECT_EQ(RunOk({command.name, "--help"}), commandHelp);
-        for (const tool::OptionSpec& option : command.options) {
+        for (const tool::OptionDecl& option : command.options) {
             EXPECT_THAT(commandHelp, HasSubstr("\n  " + option.name + " ")) << option.name;
         }
     }
@@ -669,10 +669,10 @@ TEST(ToolDocs, ManPageAndCompletionFollowTheCommandTable) {
         }
         return text;
     };
-    for (const tool::CommandSpec& command : tool::Commands()) {
+    for (const tool::CommandDecl& command : tool::Commands()) {
         EXPECT_THAT(man, HasSubstr(".SS " + command.name + " ")) << command.name;
         std::string expected = command.name + ") echo \"";
-        for (const tool::OptionSpec& option : command.options) {
+        for (const tool::OptionDecl& option : command.options) {
             EXPECT_THAT(man, HasSubstr(escaped(option.name))) << command.name << option.name;
             expected += option.name + (&option == &command.options.back() ? "\"" : " ");
         }

@@ -85,7 +85,7 @@ int RunBackup(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec BackupCommand() {
+CommandDecl BackupCommand() {
     return {
         "backup",
         "--store DIR --to COPY [--compact] [--no-progress]",

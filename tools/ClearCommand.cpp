@@ -25,7 +25,7 @@ int RunClear(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec ClearCommand() {
+CommandDecl ClearCommand() {
     return {"clear", "--store DIR", "remove every field's table", {StoreOption()}, RunClear};
 }
 

@@ -13,7 +13,7 @@ namespace {
 
 std::string CommandList() {
     std::string list;
-    const std::vector<CommandSpec>& commands = Commands();
+    const std::vector<CommandDecl>& commands = Commands();
     for (std::size_t i = 0; i < commands.size(); ++i) {
         list += (i == 0 ? "" : i + 1 == commands.size() ? " or " : ", ") + commands[i].name;
     }
@@ -22,7 +22,7 @@ std::string CommandList() {
 
 UsageError UnknownCommand(const std::string& given) {
     std::vector<std::string> names;
-    for (const CommandSpec& command : Commands()) {
+    for (const CommandDecl& command : Commands()) {
         names.push_back(command.name);
     }
     names.push_back("help");
@@ -52,14 +52,14 @@ std::string InStoreWords(std::string message) {
 }
 
 // Runs what the arguments ask for; throws UsageError for wrong ones.
-int Dispatch(const std::vector<std::string>& args, const CommandSpec*& command, Io& io) {
+int Dispatch(const std::vector<std::string>& args, const CommandDecl*& command, Io& io) {
     if (args.empty()) {
         throw UsageError{"a command is needed: " + CommandList(), ""};
     }
     const std::string& first = args.front();
     const std::vector<std::string> rest(args.begin() + 1, args.end());
     if (first == "--version" || first == "--help" || first == "-h" || first == "help") {
-        const CommandSpec* about = nullptr;
+        const CommandDecl* about = nullptr;
         if (first == "help" && !rest.empty()) {
             about = FindCommand(rest.front());
             if (about == nullptr) {
@@ -95,7 +95,7 @@ int Dispatch(const std::vector<std::string>& args, const CommandSpec*& command, 
 
 int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostream& err) {
     const std::vector<std::string> args(argv + (argc > 0 ? 1 : 0), argv + argc);
-    const CommandSpec* command = nullptr;
+    const CommandDecl* command = nullptr;
     Io io{out, err};
     try {
         return Dispatch(args, command, io);

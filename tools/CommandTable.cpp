@@ -10,8 +10,8 @@
 
 namespace tarn::tool {
 
-const OptionSpec* CommandSpec::Option(std::string_view name) const {
-    for (const OptionSpec& option : options) {
+const OptionDecl* CommandDecl::Option(std::string_view name) const {
+    for (const OptionDecl& option : options) {
         if (option.name == name) {
             return &option;
         }
@@ -19,8 +19,8 @@ const OptionSpec* CommandSpec::Option(std::string_view name) const {
     return nullptr;
 }
 
-const std::vector<CommandSpec>& Commands() {
-    static const std::vector<CommandSpec> table = {
+const std::vector<CommandDecl>& Commands() {
+    static const std::vector<CommandDecl> table = {
         RecordCommand(), ShowCommand(),     ExportCommand(), DiffCommand(),
         BackupCommand(), SitesCommand(),    MergeCommand(),  CompactCommand(),
         DumpCommand(),   ValidateCommand(), StatsCommand(),  ClearCommand(),
@@ -28,8 +28,8 @@ const std::vector<CommandSpec>& Commands() {
     return table;
 }
 
-const CommandSpec* FindCommand(std::string_view name) {
-    for (const CommandSpec& command : Commands()) {
+const CommandDecl* FindCommand(std::string_view name) {
+    for (const CommandDecl& command : Commands()) {
         if (command.name == name) {
             return &command;
         }
@@ -37,21 +37,21 @@ const CommandSpec* FindCommand(std::string_view name) {
     return nullptr;
 }
 
-OptionSpec StoreOption(const std::string& help) {
+OptionDecl StoreOption(const std::string& help) {
     return {"--store", "DIR", help};
 }
 
-OptionSpec CacheOption(const std::string& extra) {
+OptionDecl CacheOption(const std::string& extra) {
     return {"--cache-nodes", "C",
             "keep at most C tree objects in memory (0: no bound; default " +
                 std::to_string(kDefaultWalkCacheObjects) + ")" + extra};
 }
 
-OptionSpec FormatOption() {
+OptionDecl FormatOption() {
     return {"--format", "FORMAT", "text (the default), json (one document) or csv"};
 }
 
-OptionSpec NoProgressOption() {
+OptionDecl NoProgressOption() {
     return {"--no-progress", "", "no progress line on a terminal"};
 }
 
@@ -112,7 +112,7 @@ std::optional<std::string> Suggestion(std::string_view given,
     return best;
 }
 
-Arguments::Arguments(const CommandSpec& command, const std::vector<std::string>& args)
+Arguments::Arguments(const CommandDecl& command, const std::vector<std::string>& args)
     : m_command(&command) {
     const std::string& name = command.name;
     for (std::size_t i = 0; i < args.size(); ++i) {
@@ -127,10 +127,10 @@ Arguments::Arguments(const CommandSpec& command, const std::vector<std::string>&
         }
         const std::size_t equals = arg.find('=');
         const std::string option = arg.substr(0, equals);
-        const OptionSpec* spec = command.Option(option);
-        if (spec == nullptr) {
+        const OptionDecl* declared = command.Option(option);
+        if (declared == nullptr) {
             std::vector<std::string> names;
-            for (const OptionSpec& o : command.options) {
+            for (const OptionDecl& o : command.options) {
                 names.push_back(o.name);
             }
             const std::optional<std::string> near = Suggestion(option, names);
@@ -138,7 +138,7 @@ Arguments::Arguments(const CommandSpec& command, const std::vector<std::string>&
                                  (near ? ": did you mean '" + *near + "'?" : std::string()),
                              name};
         }
-        if (spec->IsFlag()) {
+        if (declared->IsFlag()) {
             if (equals != std::string::npos) {
                 throw UsageError{option + " is a flag and takes no value"};
             }
@@ -151,7 +151,7 @@ Arguments::Arguments(const CommandSpec& command, const std::vector<std::string>&
                    !(args[i + 1].starts_with("--") && args[i + 1].size() > 2)) {
             m_values.emplace_back(option, args[++i]);
         } else {
-            throw UsageError{option + " needs a value (" + spec->value + ")", name};
+            throw UsageError{option + " needs a value (" + declared->value + ")", name};
         }
     }
 }
@@ -184,9 +184,9 @@ std::optional<std::string> Arguments::Text(std::string_view option) const {
 std::string Arguments::Required(std::string_view option, std::string_view what) const {
     const std::optional<std::string> text = Text(option);
     if (!text || text->empty()) {
-        const OptionSpec* spec = m_command->Option(option);
+        const OptionDecl* declared = m_command->Option(option);
         throw UsageError{m_command->name + " needs " + std::string(option) + " " +
-                             (spec != nullptr ? spec->value : std::string("VALUE")) + ", " +
+                             (declared != nullptr ? declared->value : std::string("VALUE")) + ", " +
                              std::string(what),
                          m_command->name};
     }
@@ -257,7 +257,7 @@ std::string VersionText() {
     return std::string("offsetops ") + OFFSETOPS_VERSION;
 }
 
-void PrintHelp(std::ostream& out, const CommandSpec* command) {
+void PrintHelp(std::ostream& out, const CommandDecl* command) {
     if (command == nullptr) {
         out << VersionText()
             << ": records offset operations into an on-disk store and inspects it.\n\n"
@@ -265,7 +265,7 @@ void PrintHelp(std::ostream& out, const CommandSpec* command) {
                "       offsetops help [COMMAND]\n"
                "       offsetops --version\n\n"
                "Commands:\n";
-        for (const CommandSpec& c : Commands()) {
+        for (const CommandDecl& c : Commands()) {
             out << "  " << c.name << std::string(10 - std::min<std::size_t>(c.name.size(), 9), ' ')
                 << c.summary << '\n';
         }
@@ -279,10 +279,10 @@ void PrintHelp(std::ostream& out, const CommandSpec* command) {
     out << "Usage: offsetops " << command->name << ' ' << command->usage << "\n\n"
         << command->summary << "\n\nOptions:\n";
     std::size_t width = 0;
-    for (const OptionSpec& o : command->options) {
+    for (const OptionDecl& o : command->options) {
         width = std::max(width, o.name.size() + (o.IsFlag() ? 0 : o.value.size() + 1));
     }
-    for (const OptionSpec& o : command->options) {
+    for (const OptionDecl& o : command->options) {
         const std::string left = o.name + (o.IsFlag() ? "" : " " + o.value);
         out << "  " << left << std::string(width + 2 - left.size(), ' ') << o.help << '\n';
     }

@@ -30,7 +30,7 @@ struct UsageError {
     std::optional<std::string> help = std::nullopt;
 };
 
-struct OptionSpec {
+struct OptionDecl {
     std::string name;   // "--store"
     std::string value;  // what it takes ("DIR"); empty for a flag
     std::string help;
@@ -45,28 +45,28 @@ struct Io {
     std::ostream& err;
 };
 
-struct CommandSpec {
+struct CommandDecl {
     std::string name;
     std::string usage;    // after "offsetops NAME "
     std::string summary;  // one line
-    std::vector<OptionSpec> options;
+    std::vector<OptionDecl> options;
     int (*run)(const Arguments& args, Io& io) = nullptr;
     // The status of a failure: 1, or 2 for the commands whose 1 means
     // something else (diff: the stores differ; merge: conflicts).
     int failureStatus = kFailed;
 
-    const OptionSpec* Option(std::string_view name) const;
+    const OptionDecl* Option(std::string_view name) const;
 };
 
 // Every command, in the order help lists them.
-const std::vector<CommandSpec>& Commands();
-const CommandSpec* FindCommand(std::string_view name);
+const std::vector<CommandDecl>& Commands();
+const CommandDecl* FindCommand(std::string_view name);
 
 // The options several commands share.
-OptionSpec StoreOption(const std::string& help = "the store's directory");
-OptionSpec CacheOption(const std::string& extra = "");
-OptionSpec FormatOption();
-OptionSpec NoProgressOption();
+OptionDecl StoreOption(const std::string& help = "the store's directory");
+OptionDecl CacheOption(const std::string& extra = "");
+OptionDecl FormatOption();
+OptionDecl NoProgressOption();
 
 // The largest cache bound any command takes.
 inline constexpr uint64 kMaxCacheNodes = 1'000'000'000;
@@ -80,9 +80,9 @@ class Arguments {
 public:
     // Throws UsageError for an option the command does not take, one without
     // its value, a flag given one, or an argument that is no option.
-    Arguments(const CommandSpec& command, const std::vector<std::string>& args);
+    Arguments(const CommandDecl& command, const std::vector<std::string>& args);
 
-    const CommandSpec& Command() const { return *m_command; }
+    const CommandDecl& Command() const { return *m_command; }
     bool HelpAsked() const { return m_help; }
 
     bool Has(std::string_view option) const;
@@ -108,7 +108,7 @@ public:
     bool Progress() const;
 
 private:
-    const CommandSpec* m_command;
+    const CommandDecl* m_command;
     std::vector<std::pair<std::string, std::string>> m_values;  // option, value
     std::vector<std::string> m_flags;
     bool m_help = false;
@@ -120,7 +120,7 @@ std::optional<std::string> Suggestion(std::string_view given,
                                       const std::vector<std::string>& candidates);
 
 // The program's help (command null) or a command's.
-void PrintHelp(std::ostream& out, const CommandSpec* command);
+void PrintHelp(std::ostream& out, const CommandDecl* command);
 
 // "offsetops 0.2.0".
 std::string VersionText();

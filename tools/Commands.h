@@ -22,17 +22,17 @@
 
 namespace tarn::tool {
 
-CommandSpec RecordCommand();
-CommandSpec ShowCommand();
-CommandSpec ExportCommand();
-CommandSpec DiffCommand();
-CommandSpec BackupCommand();
-CommandSpec SitesCommand();
-CommandSpec MergeCommand();
-CommandSpec CompactCommand();
-CommandSpec DumpCommand();
-CommandSpec ValidateCommand();
-CommandSpec StatsCommand();
-CommandSpec ClearCommand();
+CommandDecl RecordCommand();
+CommandDecl ShowCommand();
+CommandDecl ExportCommand();
+CommandDecl DiffCommand();
+CommandDecl BackupCommand();
+CommandDecl SitesCommand();
+CommandDecl MergeCommand();
+CommandDecl CompactCommand();
+CommandDecl DumpCommand();
+CommandDecl ValidateCommand();
+CommandDecl StatsCommand();
+CommandDecl ClearCommand();
 
 }  // namespace tarn::tool

@@ -36,7 +36,7 @@ int RunCompact(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec CompactCommand() {
+CommandDecl CompactCommand() {
     return {
         "compact",
         "--store DIR",

@@ -168,7 +168,7 @@ int RunDiff(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec DiffCommand() {
+CommandDecl DiffCommand() {
     return {
         "diff",
         "--store A --with B [--cache-nodes C] [--format FORMAT] [--no-progress]",

@@ -15,7 +15,7 @@ int RunDump(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec DumpCommand() {
+CommandDecl DumpCommand() {
     return {"dump", "--store DIR", "print the map's tree, node by node", {StoreOption()}, RunDump};
 }
 

@@ -147,7 +147,7 @@ int RunExport(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec ExportCommand() {
+CommandDecl ExportCommand() {
     return {
         "export",
         "--store DIR [--out FILE] [--cache-nodes C] [--no-progress]",

@@ -47,7 +47,7 @@ int RunMerge(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec MergeCommand() {
+CommandDecl MergeCommand() {
     return {
         "merge",
         "--store A --from B [--dry-run] [--cache-nodes C] [--commit-every K] [--no-sync]",

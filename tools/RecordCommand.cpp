@@ -114,15 +114,25 @@ private:
                " --ops " + ShellWord(*ops) + " --skip " + std::to_string(lines);
     }
 
-    int Finished() {
+    // The operations recorded since the last durable point made durable.
+    void SyncPending() {
         if (m_recorded > m_durable) {
             Sync();
         }
+    }
+
+    // A durable point, a checkpoint, the summary of the run.
+    void CloseWithSummary() {
+        SyncPending();
         m_store.Checkpoint();
         const StoreStatistics stats = m_store.Stats();
         m_store.Close();
         m_progress.Finish();
         Summary(stats);
+    }
+
+    int Finished() {
+        CloseWithSummary();
         return 0;
     }
 
@@ -131,9 +141,7 @@ private:
         const std::string where = m_source.Position();
         // The refused operation's line, read last, is the one to fix.
         const int64 linesBefore = m_source.LinesRead() - 1;
-        if (m_recorded > m_durable) {
-            Sync();
-        }
+        SyncPending();
         m_store.Close();
         m_progress.Finish();
         return Fail(m_io.err, where + ": " + why + "; stopped there: " + DurableBefore() +
@@ -141,14 +149,7 @@ private:
     }
 
     int Stopped(int signal) {
-        if (m_recorded > m_durable) {
-            Sync();
-        }
-        m_store.Checkpoint();
-        const StoreStatistics stats = m_store.Stats();
-        m_store.Close();
-        m_progress.Finish();
-        Summary(stats);
+        CloseWithSummary();
         m_io.out.flush();
         Fail(m_io.err, "stopped by " + SignalName(signal) + " at a durable point: " +
                            (m_durable == 1 ? std::string("the 1 operation of this run is durable")
@@ -308,7 +309,7 @@ int RunRecord(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec RecordCommand() {
+CommandDecl RecordCommand() {
     const std::string walkBound = std::to_string(kMaxCacheNodes);
     return {
         "record",

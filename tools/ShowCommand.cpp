@@ -158,7 +158,7 @@ int RunShow(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec ShowCommand() {
+CommandDecl ShowCommand() {
     return {
         "show",
         "--store DIR [--field OID/PATH | --oid N | --from OID/PATH [--to OID/PATH]] [--limit N] "

@@ -39,7 +39,7 @@ int RunSites(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec SitesCommand() {
+CommandDecl SitesCommand() {
     return {
         "sites",
         "--store DIR [--format FORMAT]",

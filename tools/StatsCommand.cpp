@@ -57,7 +57,7 @@ int RunStats(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec StatsCommand() {
+CommandDecl StatsCommand() {
     return {
         "stats",
         "--store DIR [--format FORMAT]",

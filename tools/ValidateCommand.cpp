@@ -111,7 +111,7 @@ int RunValidate(const Arguments& args, Io& io) {
 
 }  // namespace
 
-CommandSpec ValidateCommand() {
+CommandDecl ValidateCommand() {
     return {
         "validate",
         "--store DIR [--cache-nodes C] [--format FORMAT]",
