@@ -29,16 +29,14 @@
 #include <utility>
 
 #include "bench/Subjects.h"
-#include "tnRuntime/MemoryStore.h"
+#include "tnBackends/MemoryStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/MemoryOutputStream.h"
 
-#ifdef TARN_HAVE_LMDB
 #include <lmdb.h>
 
-#include "tnRuntime/LmdbStore.h"
-#endif
+#include "tnBackends/LmdbStore.h"
 
 namespace tarn::bench {
 namespace {
@@ -50,16 +48,11 @@ enum StoreKind { kMemory = 0, kLmdbSync = 1, kLmdbNoSync = 2 };
 
 // A store of the given kind; LMDB stores live in `dir`.
 std::shared_ptr<IStore> MakeStore(StoreKind kind, const ScratchDir& dir) {
-#ifdef TARN_HAVE_LMDB
     if (kind != kMemory) {
         LmdbStoreOptions options;
         options.syncOnCommit = kind == kLmdbSync;
         return LmdbStore::Open(dir.Sub("store"), options);
     }
-#else
-    (void)dir;
-    (void)kind;
-#endif
     return std::make_shared<MemoryStore>();
 }
 
@@ -134,8 +127,6 @@ void Reload(benchmark::State& state, StoreKind kind) {
     }
     state.SetItemsProcessed(state.iterations() * static_cast<int64>(kNumFields));
 }
-
-#ifdef TARN_HAVE_LMDB
 
 // The peer: one LMDB environment holding, in its main database, one record
 // per field: key = oid (8 bytes big-endian) then the path bytes, so that
@@ -277,8 +268,6 @@ void ReloadDirect(benchmark::State& state, StoreKind kind) {
     state.SetItemsProcessed(state.iterations() * static_cast<int64>(kNumFields));
 }
 
-#endif  // TARN_HAVE_LMDB
-
 // Wall-clock time throughout: a synced commit spends most of its time
 // waiting for the disk, which CPU time would not show.
 void Timing(benchmark::internal::Benchmark* b, benchmark::TimeUnit unit) {
@@ -295,10 +284,8 @@ int main(int argc, char** argv) {
         StoreKind kind;
     };
     std::vector<Kind> kinds = {{"memory", kMemory}};
-#ifdef TARN_HAVE_LMDB
     kinds.push_back({"lmdb", kLmdbSync});
     kinds.push_back({"lmdb_nosync", kLmdbNoSync});
-#endif
     for (const Kind& k : kinds) {
         for (std::size_t leaves : {1, 16, 256}) {
             const std::string name =
@@ -306,7 +293,6 @@ int main(int argc, char** argv) {
             Timing(benchmark::RegisterBenchmark(name.c_str(), CommitLeaves, k.kind, leaves),
                    benchmark::kMicrosecond);
         }
-#ifdef TARN_HAVE_LMDB
         if (k.kind != kMemory) {
             for (std::size_t tables : {1, 16, 256}) {
                 const std::string name =
@@ -315,17 +301,14 @@ int main(int argc, char** argv) {
                        benchmark::kMicrosecond);
             }
         }
-#endif
     }
     for (const Kind& k : kinds) {
         Timing(
             benchmark::RegisterBenchmark((std::string("Reload/") + k.name).c_str(), Reload, k.kind),
             benchmark::kMillisecond);
     }
-#ifdef TARN_HAVE_LMDB
     Timing(benchmark::RegisterBenchmark("Reload/direct_lmdb", ReloadDirect, kLmdbNoSync),
            benchmark::kMillisecond);
-#endif
     benchmark::Initialize(&argc, argv);
     if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
         return 1;

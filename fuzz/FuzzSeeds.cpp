@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "fuzz/FuzzStore.h"
-#include "tnRuntime/MemoryStore.h"
+#include "tnBackends/MemoryStore.h"
 #include "tools/OpsFile.h"
 
 namespace {

@@ -4,7 +4,7 @@
 // from the fuzzer, read through the same record check as the on-disk store,
 // and a bounded walk over a loaded record or map.
 //
-// FuzzStore keeps one framed record (tnRuntime/ImageRecord.h) per identity
+// FuzzStore keeps one framed record (tnBackends/ImageRecord.h) per identity
 // and answers Load exactly as LmdbStore does after its database lookup:
 // DecodeImageRecord, which throws RuntimeError for a damaged record. It is
 // never committed to.
@@ -16,12 +16,12 @@
 #include <string>
 #include <vector>
 
+#include "tnBackends/IStore.h"
+#include "tnBackends/ImageRecord.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/IStore.h"
-#include "tnRuntime/ImageRecord.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/MemoryOutputStream.h"
 

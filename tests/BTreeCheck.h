@@ -15,13 +15,13 @@
 #include <utility>
 #include <vector>
 
+#include "tnBackends/MemoryStore.h"
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
 #include "tnRuntime/ClassRegistry.h"
-#include "tnRuntime/MemoryStore.h"
 #include "tnRuntime/RuntimeCallLog.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnUtils/Archive.h"

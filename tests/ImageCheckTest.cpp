@@ -7,10 +7,10 @@
 #include <string>
 #include <vector>
 
+#include "tnBackends/MemoryStore.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/MemoryStore.h"
 #include "tnStore/RegisterClasses.h"
 
 namespace tarn {

@@ -1,13 +1,11 @@
 // The record the LMDB store keeps per image: its layout, and that every
 // truncation and every changed byte is reported with the identity and fault.
 
-#include "tnRuntime/ImageRecord.h"
+#include "tnBackends/ImageRecord.h"
 
 #include <gtest/gtest.h>
 
 #include <string>
-
-#ifdef TARN_HAVE_LMDB
 
 namespace tarn {
 namespace {
@@ -77,5 +75,3 @@ TEST(ImageRecordChecks, EveryTruncationAndChangedByteIsReported) {
 
 }  // namespace
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

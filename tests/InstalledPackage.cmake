@@ -27,10 +27,25 @@ foreach(header tnStore/OffsetOpsStore.h tnStore/FieldCursor.h tnStore/FieldTable
         message(FATAL_ERROR "the API header ${header} is not installed")
     endif()
 endforeach()
-foreach(header tnRuntime/CSpace.h tnStore/StoreImpl.h tnRuntime/LmdbStore.h
-               tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h)
+foreach(header tnRuntime/CSpace.h tnStore/StoreImpl.h tnBackends/LmdbStore.h
+               tnObject/RuntimeInterface.h tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h)
     if(EXISTS ${prefix}/include/tarn/${header})
         message(FATAL_ERROR "the internal header ${header} is installed")
+    endif()
+endforeach()
+# Nothing at all of the object runtime, the storage backends or the module's
+# own folder: the API's headers reach none of them.
+foreach(folder tnRuntime tnBackends tnOperation/src/WorkingSet)
+    if(EXISTS ${prefix}/include/tarn/${folder})
+        message(FATAL_ERROR "internal headers installed: include/tarn/${folder}")
+    endif()
+endforeach()
+
+# The library of every layer, which a static library needs beside it.
+foreach(library tarn tarn_module tarn_runtime tarn_objects tarn_backends tarn_values)
+    file(GLOB_RECURSE archive ${prefix}/*/lib${library}.a)
+    if(NOT archive)
+        message(FATAL_ERROR "lib${library}.a is not installed")
     endif()
 endforeach()
 

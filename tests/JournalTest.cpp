@@ -19,8 +19,6 @@
 
 #include "tnUtils/RuntimeError.h"
 
-#ifdef TARN_HAVE_LMDB
-
 namespace tarn {
 namespace {
 
@@ -285,5 +283,3 @@ TEST(JournalDamage, IsARuntimeErrorNamingTheFileAndWhereAndStopsTheScan) {
 
 }  // namespace
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

@@ -3,11 +3,9 @@
 // are refused, and readers in other processes keep their snapshot beside the
 // one writer.
 
-#include "tnRuntime/LmdbStore.h"
+#include "tnBackends/LmdbStore.h"
 
 #include <gtest/gtest.h>
-
-#ifdef TARN_HAVE_LMDB
 
 #include <signal.h>
 #include <sys/wait.h>
@@ -28,8 +26,8 @@
 #include <xxhash.h>
 
 #include "tests/AssertDeath.h"
-#include "tnRuntime/ImageRecord.h"
-#include "tnRuntime/LmdbFileCheck.h"
+#include "tnBackends/ImageRecord.h"
+#include "tnBackends/LmdbFileCheck.h"
 
 namespace tarn {
 namespace {
@@ -1215,5 +1213,3 @@ TEST(LmdbStoreOpening, ReadersBesideAWriterInAnotherProcessKeepTheirSnapshot) {
 
 }  // namespace
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

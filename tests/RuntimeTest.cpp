@@ -10,10 +10,10 @@
 
 #include "tests/AssertDeath.h"
 #include "tests/TestPersistable.h"
+#include "tnBackends/MemoryStore.h"
+#include "tnBackends/OverlayStore.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/MemoryStore.h"
-#include "tnRuntime/OverlayStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnUtils/MemoryOutputStream.h"

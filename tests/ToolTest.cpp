@@ -21,9 +21,9 @@ TEST(ToolTest, NeedsTheTools) {
 #include <sstream>
 
 #include "tests/ToolSupport.h"
+#include "tnBackends/LmdbStore.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/LmdbStore.h"
 #include "tnRuntime/SpaceRef.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tools/Generator.h"

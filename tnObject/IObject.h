@@ -19,6 +19,7 @@
 #include <cstddef>
 #include <type_traits>
 
+#include "tnObject/RuntimeInterface.h"
 #include "tnObject/TypeOps.h"
 #include "tnUtils/Types.h"
 
@@ -383,39 +384,8 @@ const ReflectedClass& GetReflectedClass() {
     return _GetReflected(static_cast<T*>(nullptr));
 }
 
-// Results of entering names into the registry.
-enum ENameSpaceError {
-    NSE_OK = 0,
-    NSE_COLON_EXPECTED = 1,
-    NSE_IDENTIFIER_EXPECTED = 2,
-    NSE_NAME_ALREADY_IN_USE = 3,
-    NSE_NAME_NOT_FOUND = 4,
-    NSE_NOT_A_NAMESPACE = 5,
-};
-
-// A registration target: the part of the class registry that belongs to one
-// library. Opaque outside the runtime (tnRuntime/ClassRegistry.h).
-class XTarget;
-
-// Enters `rc` under rc->m_name. Class names are unique across all targets: a
-// second registration of a name returns NSE_NAME_ALREADY_IN_USE and changes
-// nothing. A malformed name (not identifiers joined by "::") returns
-// NSE_COLON_EXPECTED or NSE_IDENTIFIER_EXPECTED.
-ENameSpaceError RegisterReflectedClass(const ReflectedClass* rc, XTarget* target);
-
-// The registration target of the library that holds the offset operations
-// record and its B+tree ("tnOperation").
-XTarget* Tarn_tnOperation_GetXTarget();
-
 // ---------------------------------------------------------------------------
-// The calling thread's space and lock (kept by tnRuntime/CSpaceGuard)
-
-// The space the calling thread works in, null when it holds none.
-CSpace* GetThreadCSpace();
-
-// The lock the calling thread holds on `space`: > 0 exclusive (the nesting
-// depth of its guards), < 0 shared (minus the depth), 0 none.
-int32 GetRecordedLockStatus(const CSpace* space);
+// The calling thread's space and lock (functions of the runtime's interface)
 
 template <typename T>
 T* GetThreadPtr();

@@ -150,38 +150,8 @@ public:
 };
 
 // ---------------------------------------------------------------------------
-// Runtime functions called by persistable code (implemented in tnRuntime/)
-
-// Takes a newly constructed object under the management of the calling
-// thread's space: gives it its identity at once, makes it resident and
-// queues it for the next commit. The thread must hold a space exclusively.
-void RegisterGcObject(ptr<IObject> obj);
-
-// Sets the object's dirty flag and queues it for the next commit. Harmless on
-// a dirty object. An object that was never registered (no space, no
-// identity: a temporary made by copy construction) is not tracked, and this
-// does nothing for it.
-void MarkPersistentAsDirtyWithoutTrace(ptr<const IPersistable> obj);
-
-// The persistence side of collecting `obj`: the object leaves its space
-// (no longer resident, no longer queued; pending changes are discarded and
-// its dirty flag cleared) so that it may be destroyed. Nothing for an
-// object that was never registered.
-void OnGarbageCollectPersistable(ptr<IPersistable> obj);
-
-// Records that `to` is reachable from `from`. The runtime deletes only what
-// it is told to delete (AsyncPermanentlyDelete…) and writes what is marked,
-// so reachability needs no bookkeeping: the call is counted in the thread's
-// RuntimeCallLog and otherwise does nothing. The flag is accepted and
-// ignored.
-void DeclareReachable(ptr<const IPersistable> from, ptr<const IPersistable> to, bool flag);
-
-// Queue `obj` (alone, following none of its references) / `obj` and every
-// object below it along VisitPrefs, for permanent deletion. The next commit
-// removes their images and destroys them; nothing is destroyed before. A
-// null handle is ignored.
-void AsyncPermanentlyDeleteObject(ptr<IPersistable> obj);
-void AsyncPermanentlyDeleteSubTree(ptr<IPersistable> obj);
+// Creation (RegisterGcObject and the other lifecycle functions that
+// persistable code calls are the runtime's: tnObject/RuntimeInterface.h)
 
 // Registers a newly constructed object and returns it. If registration
 // fails the object is deleted and the exception passes on.

@@ -24,8 +24,8 @@
 // kept across eviction or commit; user code keeps identities, root names or
 // a space-tracked SpaceRef (tnRuntime/SpaceRef.h) instead.
 //
-// The operations that reach into the space (Resolve, GetInMemory,
-// TryResolvePref) are the runtime's, defined in tnRuntime/PrefResolution.cpp.
+// The operations that reach into the space (ResolvePref, FindResidentPref,
+// TryResolvePref) are the runtime's (tnObject/RuntimeInterface.h).
 //
 // Byte image (Serialise / Deserialise; the flag argument is ignored):
 //   identity   8 bytes   m_oid.value_, little-endian; 0 for an empty reference
@@ -94,7 +94,7 @@ public:
 
     // The bound handle, or the resident object of that identity in the
     // thread's space; never loads, never binds. Null otherwise.
-    ptr<IPersistable> GetInMemory() const;
+    ptr<IPersistable> GetInMemory() const { return FindResidentPref(*this); }
 
     void Serialise(Archive& ar, bool flag) const;
     void Deserialise(InputArchive& ar, bool flag);
@@ -117,15 +117,13 @@ public:
 
     // The slow path of Get: resolves m_oid in the thread's space. `expected`
     // (null: any class) is the class the object must have. Empty -> null.
-    ptr<IPersistable> Resolve(const ReflectedClass* expected) const;
+    ptr<IPersistable> Resolve(const ReflectedClass* expected) const {
+        return ResolvePref(*this, expected);
+    }
 
     OID m_oid;
     mutable ptr<IPersistable> m_ptr;
 };
-
-// The object of `r` as Get would return it, but null instead of an exception
-// when it cannot be loaded.
-void* TryResolvePref(const prefbase& r, const ReflectedClass* expected);
 
 // The class record a cref<T> expects of its object, when T has one.
 template <typename T>

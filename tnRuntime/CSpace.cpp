@@ -5,9 +5,9 @@
 
 #include <string>
 
+#include "tnBackends/MemoryStore.h"
 #include "tnPersistStore/pref.h"
 #include "tnRuntime/ClassRegistry.h"
-#include "tnRuntime/MemoryStore.h"
 #include "tnUtils/Archive.h"
 #include "tnUtils/Assert.h"
 

@@ -78,9 +78,9 @@
 #include <unordered_set>
 #include <vector>
 
+#include "tnBackends/IStore.h"
 #include "tnPersistStore/IPersistable.h"
 #include "tnPersistStore/OID.h"
-#include "tnRuntime/IStore.h"
 
 namespace tarn {
 

@@ -1,6 +1,6 @@
-// The runtime's raw byte exchange, declared in tnUtils/MemSwap.h.
+// The runtime's raw byte exchange (tnObject/RuntimeInterface.h).
 
-#include "tnUtils/MemSwap.h"
+#include "tnObject/RuntimeInterface.h"
 
 #include <algorithm>
 

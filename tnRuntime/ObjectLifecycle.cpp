@@ -1,6 +1,7 @@
-// The runtime functions that persistable code calls (declared in
-// tnPersistStore/IPersistable.h): each finds the object's space and hands the
-// work to it, and counts the call in the thread's RuntimeCallLog.
+// The lifecycle functions of the runtime's interface
+// (tnObject/RuntimeInterface.h) that persistable code calls: each finds the
+// object's space and hands the work to it, and counts the call in the
+// thread's RuntimeCallLog.
 
 #include "tnPersistStore/IPersistable.h"
 #include "tnRuntime/CSpace.h"

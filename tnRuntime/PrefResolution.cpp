@@ -1,6 +1,6 @@
-// The reference operations that reach into the thread's space (declared in
-// tnPersistStore/pref.h): resolving an unbound reference, finding its
-// resident object, and resolving without an exception.
+// The reference operations that reach into the thread's space (the runtime's
+// interface, tnObject/RuntimeInterface.h): resolving an unbound reference,
+// finding its resident object, and resolving without an exception.
 
 #include "tnPersistStore/pref.h"
 #include "tnRuntime/CSpace.h"
@@ -9,33 +9,33 @@
 
 namespace tarn {
 
-ptr<IPersistable> prefbase::Resolve(const ReflectedClass* expected) const {
-    if (m_ptr.m_self != nullptr) {
-        return m_ptr;
+ptr<IPersistable> ResolvePref(const prefbase& r, const ReflectedClass* expected) {
+    if (r.m_ptr.m_self != nullptr) {
+        return r.m_ptr;
     }
-    if (m_oid.IsNull()) {
+    if (r.m_oid.IsNull()) {
         return ptr<IPersistable>();
     }
     CSpace* space = GetThreadCSpace();
     TARN_ASSERT(space != nullptr);
-    ptr<IPersistable> obj = space->Resolve(m_oid, expected);
+    ptr<IPersistable> obj = space->Resolve(r.m_oid, expected);
     if (GetRecordedLockStatus(space) > 0) {
-        m_ptr = obj;
+        r.m_ptr = obj;
     }
     return obj;
 }
 
-ptr<IPersistable> prefbase::GetInMemory() const {
-    if (m_ptr.m_self != nullptr || m_oid.IsNull()) {
-        return m_ptr;
+ptr<IPersistable> FindResidentPref(const prefbase& r) {
+    if (r.m_ptr.m_self != nullptr || r.m_oid.IsNull()) {
+        return r.m_ptr;
     }
     CSpace* space = GetThreadCSpace();
-    return space != nullptr ? space->FindResident(m_oid) : ptr<IPersistable>();
+    return space != nullptr ? space->FindResident(r.m_oid) : ptr<IPersistable>();
 }
 
 void* TryResolvePref(const prefbase& r, const ReflectedClass* expected) {
     try {
-        return r.Resolve(expected).m_self;
+        return ResolvePref(r, expected).m_self;
     } catch (const RuntimeError&) {
         return nullptr;
     }

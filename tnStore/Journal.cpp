@@ -1,7 +1,6 @@
 #include "tnStore/Journal.h"
 
 // The checksums come from libxxhash, found together with LMDB.
-#ifdef TARN_HAVE_LMDB
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -571,5 +570,3 @@ void Journal::Commit() {
 }
 
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

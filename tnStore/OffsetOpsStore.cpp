@@ -7,9 +7,9 @@
 #include <filesystem>
 #include <utility>
 
-#include "tnRuntime/LmdbStore.h"
-#include "tnRuntime/MemoryStore.h"
-#include "tnRuntime/OverlayStore.h"
+#include "tnBackends/LmdbStore.h"
+#include "tnBackends/MemoryStore.h"
+#include "tnBackends/OverlayStore.h"
 #include "tnStore/RegisterClasses.h"
 #include "tnStore/StoreImpl.h"
 #include "tnStore/TreeSummary.h"

@@ -29,7 +29,7 @@
 #include <thread>
 #include <vector>
 
-#include "tnRuntime/LmdbStore.h"
+#include "tnBackends/LmdbStore.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnStore/StoreImpl.h"
 #include "tnUtils/FileIo.h"

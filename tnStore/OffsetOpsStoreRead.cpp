@@ -6,8 +6,8 @@
 #include <tuple>
 #include <utility>
 
+#include "tnBackends/LmdbFileCheck.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
-#include "tnRuntime/LmdbFileCheck.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnStore/Reachability.h"
 #include "tnStore/StoreImpl.h"

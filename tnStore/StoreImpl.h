@@ -16,13 +16,13 @@
 #include <string>
 #include <vector>
 
+#include "tnBackends/CountingStore.h"
+#include "tnBackends/LmdbStore.h"
+#include "tnBackends/OverlayStore.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnRuntime/CSpace.h"
 #include "tnRuntime/CSpaceGuard.h"
-#include "tnRuntime/LmdbStore.h"
-#include "tnRuntime/OverlayStore.h"
 #include "tnRuntime/SpaceRef.h"
-#include "tnStore/CountingStore.h"
 #include "tnStore/Journal.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnStore/TreeLoadCheck.h"

@@ -6,9 +6,9 @@
 
 #include <cstring>
 
+#include "tnObject/RuntimeInterface.h"
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnUtils/Assert.h"
-#include "tnUtils/MemSwap.h"
 
 namespace tarn {
 

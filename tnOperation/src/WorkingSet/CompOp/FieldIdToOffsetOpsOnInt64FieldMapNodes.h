@@ -27,11 +27,11 @@
 #include <utility>
 
 #include "tnObject/IObject.h"
+#include "tnObject/RuntimeInterface.h"
 #include "tnOperation/FieldId.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h"
 #include "tnPersistStore/IPersistable.h"
 #include "tnPersistStore/pref.h"
-#include "tnUtils/MemSwap.h"
 #include "tnUtils/Types.h"
 
 namespace tarn {

@@ -8,7 +8,7 @@
 // databases:
 //   "images"  key: identity, 8 bytes big-endian (so byte order is numeric
 //             order and the file reads the same on every host);
-//             value: the framed image record of tnRuntime/ImageRecord.h.
+//             value: the framed image record of tnBackends/ImageRecord.h.
 //   "meta"    one record under the key "state" that holds every meta value
 //             under one checksum (format version 2). All integers are
 //             little-endian:
@@ -104,7 +104,7 @@
 //   are all reported as RuntimeError naming the directory and, for a record,
 //   the identity. The record frame guards the image bytes, and the meta
 //   record's checksum the meta values. Before LMDB maps the files
-//   (tnRuntime/LmdbFileCheck.h), data.mdb is checked against its meta pages (a
+//   (tnBackends/LmdbFileCheck.h), data.mdb is checked against its meta pages (a
 //   short file would fault when touched) and lock.mdb's header is checked: a
 //   few reads, whatever the size of the store. A damaged lock file nobody uses
 //   is made anew and reported in Repairs(). Opening walks no tree: it reads the
@@ -136,7 +136,7 @@
 #include <utility>
 #include <vector>
 
-#include "tnRuntime/IStore.h"
+#include "tnBackends/IStore.h"
 
 struct MDB_env;
 struct MDB_txn;

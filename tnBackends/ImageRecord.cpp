@@ -1,7 +1,6 @@
-#include "tnRuntime/ImageRecord.h"
+#include "tnBackends/ImageRecord.h"
 
 // The checksum comes from libxxhash, found together with LMDB.
-#ifdef TARN_HAVE_LMDB
 
 #include <cstdio>
 #include <cstring>
@@ -112,5 +111,3 @@ StoredImage DecodeImageRecord(uint64 oid, std::span<const octet_t> record) {
 }
 
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

@@ -1,4 +1,4 @@
-#include "tnRuntime/OverlayStore.h"
+#include "tnBackends/OverlayStore.h"
 
 #include <fcntl.h>
 #include <unistd.h>

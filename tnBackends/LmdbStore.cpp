@@ -1,7 +1,6 @@
-#include "tnRuntime/LmdbStore.h"
+#include "tnBackends/LmdbStore.h"
 
 // Without LMDB the library builds without the on-disk store.
-#ifdef TARN_HAVE_LMDB
 
 #include <fcntl.h>
 #include <setjmp.h>
@@ -30,8 +29,8 @@
 #include <lmdb.h>
 #include <xxhash.h>
 
-#include "tnRuntime/ImageRecord.h"
-#include "tnRuntime/LmdbFileCheck.h"
+#include "tnBackends/ImageRecord.h"
+#include "tnBackends/LmdbFileCheck.h"
 #include "tnUtils/Assert.h"
 #include "tnUtils/LittleEndian.h"
 #include "tnUtils/UniqueFd.h"
@@ -115,7 +114,7 @@ constexpr std::size_t kIdentityChunk = 1024;
 // child page number naming another leaf) gives a wrong answer without a
 // fault: most often "no such image"; a record found instead of another fails
 // its checksum, which binds it to its identity, and the meta record has a
-// checksum of its own. CheckLmdbPages (tnRuntime/LmdbFileCheck.h) walks
+// checksum of its own. CheckLmdbPages (tnBackends/LmdbFileCheck.h) walks
 // every page for a whole-store validation. A program that installs its own
 // SIGSEGV or SIGBUS handler after the first store was opened takes the
 // faults from the guard (then they end as they would without it).
@@ -1593,5 +1592,3 @@ std::unique_ptr<IStore> OpenStore(const std::string& dir, OpenMode mode) {
 }
 
 }  // namespace tarn
-
-#endif  // TARN_HAVE_LMDB

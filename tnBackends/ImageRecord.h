@@ -22,7 +22,7 @@
 #include <span>
 #include <vector>
 
-#include "tnRuntime/IStore.h"
+#include "tnBackends/IStore.h"
 #include "tnUtils/Types.h"
 
 namespace tarn {

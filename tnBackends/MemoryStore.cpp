@@ -1,4 +1,4 @@
-#include "tnRuntime/MemoryStore.h"
+#include "tnBackends/MemoryStore.h"
 
 #include <mutex>
 #include <vector>

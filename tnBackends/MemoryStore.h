@@ -8,7 +8,7 @@
 #include <map>
 #include <shared_mutex>
 
-#include "tnRuntime/IStore.h"
+#include "tnBackends/IStore.h"
 
 namespace tarn {
 

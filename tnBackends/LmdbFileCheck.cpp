@@ -1,4 +1,4 @@
-#include "tnRuntime/LmdbFileCheck.h"
+#include "tnBackends/LmdbFileCheck.h"
 
 #include <fcntl.h>
 #include <sys/file.h>

@@ -7,7 +7,7 @@
 
 #include <memory>
 
-#include "tnRuntime/IStore.h"
+#include "tnBackends/IStore.h"
 
 namespace tarn {
 

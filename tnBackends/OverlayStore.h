@@ -28,7 +28,7 @@
 #include <unordered_map>
 #include <vector>
 
-#include "tnRuntime/IStore.h"
+#include "tnBackends/IStore.h"
 
 namespace tarn {
 
