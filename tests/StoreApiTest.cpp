@@ -173,7 +173,15 @@ TEST_F(TempStore, ErrorsCarryTheirCategory) {
                   Category::Refused);
         EXPECT_EQ(categoryOf([&] { writer.Merge(m_dir); }), Category::Refused);
         EXPECT_EQ(categoryOf([&] { writer.Backup(m_dir / "inside"); }), Category::Refused);
+        EXPECT_EQ(categoryOf([&] { writer.Backup(""); }), Category::Refused);
+        // A target under a file cannot be made: the file system's own answer.
+        const fs::path plain = m_dir.string() + "-plain-file";
+        std::ofstream(plain) << "x";
+        EXPECT_EQ(categoryOf([&] { writer.Backup(plain / "copy"); }), Category::NotFound);
+        fs::remove(plain);
     }
+    EXPECT_EQ(categoryOf([&] { OffsetOpsStore::OpenInMemory().Backup(m_dir / "copy"); }),
+              Category::Refused);
     {
         OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, reading);
         EXPECT_EQ(categoryOf([&] { reader.Record(Opid(Site(1), 6), Field(1), 1); }),

@@ -537,9 +537,10 @@ void Journal::Commit() {
     }
     const std::size_t length = m_payload.size() - kRecordHeaderBytes;
     if (length > kMaxPayload) {
-        throw RuntimeError("journal '" + m_path + "': cannot write a record of " +
-                           std::to_string(length) + " bytes, over the limit of " +
-                           std::to_string(kMaxPayload));
+        throw RuntimeError(RuntimeError::Category::Refused,
+                           "journal '" + m_path + "': cannot write a record of " +
+                               std::to_string(length) + " bytes, over the limit of " +
+                               std::to_string(kMaxPayload));
     }
     octet_t* header = m_payload.data();
     const octet_t* payload = header + kRecordHeaderBytes;

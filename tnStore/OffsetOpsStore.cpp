@@ -366,9 +366,10 @@ void OpenReader(OffsetOpsStore::Impl& s) {
             return;
         } catch (const SnapshotTooOld&) {
             if (attempt == kReaderAttempts) {
-                throw RuntimeError("journal '" + path +
-                                   "' keeps moving past the store's "
-                                   "checkpoints; try again");
+                throw RuntimeError(RuntimeError::Category::InUse,
+                                   "journal '" + path +
+                                       "' keeps moving past the store's "
+                                       "checkpoints; try again");
             }
         }
     }

@@ -73,12 +73,16 @@ void RequireFreeTarget(const fs::path& to) {
                                "backup target '" + to.string() + "' exists and is not empty");
         }
     } else if (ec && ec != std::errc::no_such_file_or_directory) {
-        throw RuntimeError("backup target '" + to.string() + "': " + ec.message());
+        throw RuntimeError(RuntimeError::CategoryOfErrno(ec.value()),
+                           "backup target '" + to.string() + "': " + ec.message());
     }
     const fs::path parent = to.has_parent_path() ? to.parent_path() : fs::path(".");
     fs::create_directories(parent, ec);
     if (ec || !fs::is_directory(parent, ec)) {
-        throw RuntimeError("cannot make the directory '" + parent.string() + "': " + ec.message());
+        throw RuntimeError(
+            ec ? RuntimeError::CategoryOfErrno(ec.value()) : RuntimeError::Category::Refused,
+            "cannot make the directory '" + parent.string() +
+                "': " + (ec ? ec.message() : std::string("it is not a directory")));
     }
 }
 
@@ -91,8 +95,10 @@ public:
         std::error_code ec;
         fs::remove_all(m_path, ec);  // left by an earlier run of this process id
         if (!fs::create_directory(m_path, ec)) {
-            throw RuntimeError("cannot make the directory '" + m_path.string() +
-                               "': " + (ec ? ec.message() : std::string("it exists")));
+            throw RuntimeError(
+                ec ? RuntimeError::CategoryOfErrno(ec.value()) : RuntimeError::Category::InUse,
+                "cannot make the directory '" + m_path.string() +
+                    "': " + (ec ? ec.message() : std::string("it exists")));
         }
     }
     ~PartialCopy() {
@@ -112,8 +118,9 @@ public:
         if (::rename(m_path.c_str(), to.c_str()) != 0) {
             const int error = errno;
             if (error == ENOTEMPTY || error == EEXIST) {
-                throw RuntimeError("backup target '" + to.string() +
-                                   "' is no longer empty: something wrote into it meanwhile");
+                throw RuntimeError(RuntimeError::Category::InUse,
+                                   "backup target '" + to.string() +
+                                       "' is no longer empty: something wrote into it meanwhile");
             }
             IoFailure(to.string(), "renaming the copy to", error);
         }
@@ -186,7 +193,8 @@ void CopyPrefix(int fd, const std::string& source, uint64 bytes, const std::stri
             IoFailure(source, "reading", errno);
         }
         if (got < static_cast<ssize_t>(want)) {
-            throw RuntimeError("journal '" + source + "' was cut while being copied");
+            throw RuntimeError(RuntimeError::Category::InUse,
+                               "journal '" + source + "' was cut while being copied");
         }
         if (const int error = WriteAt(out.Get(), buffer.data(), want, at)) {
             IoFailure(target, "writing", error);
@@ -323,7 +331,7 @@ bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
 BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::string& to,
                         const BackupOptions& options) {
     if (to.empty()) {
-        throw RuntimeError("a backup needs a target directory");
+        throw RuntimeError(RuntimeError::Category::Refused, "a backup needs a target directory");
     }
     // "b/" and "b/." name the directory b.
     fs::path target = fs::path(to).lexically_normal();
@@ -346,10 +354,11 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
     BackupResult result;
     for (int attempt = 1; !TryCopy(lmdb, dir, copy.Path(), options, result); ++attempt) {
         if (attempt == kBackupAttempts) {
-            throw RuntimeError("no backup made: in " + std::to_string(kBackupAttempts) +
-                               " attempts, the checkpoint copied from store '" + dir +
-                               "' never met its journal: the store is damaged, or its writer "
-                               "checkpointed twice as each attempt began");
+            throw RuntimeError(RuntimeError::Category::InUse,
+                               "no backup made: in " + std::to_string(kBackupAttempts) +
+                                   " attempts, the checkpoint copied from store '" + dir +
+                                   "' never met its journal: the store is damaged, or its writer "
+                                   "checkpointed twice as each attempt began");
         }
     }
     CheckCopyAsReader(dir, copy.Path());
@@ -371,7 +380,8 @@ BackupResult OffsetOpsStore::Backup(const std::filesystem::path& to, const Backu
     Impl& s = Live();
     s.RequireOpen();
     if (s.lmdb == nullptr) {
-        throw RuntimeError("an in-memory store cannot be backed up");
+        throw RuntimeError(RuntimeError::Category::Refused,
+                           "an in-memory store cannot be backed up");
     }
     return BackupWith(*s.lmdb, s.dir, to.string(), options);
 }

@@ -121,7 +121,7 @@ DiffCounts Compare(OffsetOpsStore& a, OffsetOpsStore& b, bool progressWanted, Fo
         }
         if (progress.Enabled()) {
             progress.Show(walked, total,
-                          std::to_string(walked) + " of " + std::to_string(total) + " fields");
+                          std::to_string(walked) + " of " + Counted(total, "field", "fields"));
         }
     }
     progress.Finish();

@@ -122,7 +122,7 @@ int RunExport(const Arguments& args, Io& io) {
         ++done;
         if (progress.Enabled()) {
             progress.Show(static_cast<uint64>(done), static_cast<uint64>(fields),
-                          std::to_string(done) + " of " + std::to_string(fields) + " fields");
+                          std::to_string(done) + " of " + Counted(fields, "field", "fields"));
         }
         return static_cast<bool>(sink);
     });

@@ -77,7 +77,7 @@ public:
                 if (m_progress.Enabled() && (m_recorded & 1023) == 0) {
                     const auto [done, total] = m_source.Share(m_recorded);
                     m_progress.Show(done, total,
-                                    std::to_string(m_recorded) + " operations, " +
+                                    Counted(m_recorded, "operation", "operations") + ", " +
                                         std::to_string(m_durable) + " durable");
                 }
             }
