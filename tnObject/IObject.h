@@ -385,7 +385,8 @@ const ReflectedClass& GetReflectedClass() {
 }
 
 // ---------------------------------------------------------------------------
-// The calling thread's space and lock (functions of the runtime's interface)
+// The calling thread's space and lock, asked of the runtime through
+// GetThreadCSpace and GetRecordedLockStatus (tnObject/RuntimeInterface.h)
 
 template <typename T>
 T* GetThreadPtr();

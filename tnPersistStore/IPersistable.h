@@ -2,7 +2,8 @@
 
 // Persistable objects: the persistence state every stored object carries, the
 // IPersistable interface with its function table, the mixin that gives a
-// class all of this, and the runtime functions that persistable code calls.
+// class all of this, and DollarNew. The runtime functions that persistable
+// code calls are declared in tnObject/RuntimeInterface.h.
 //
 // A persistable class is written as
 //
