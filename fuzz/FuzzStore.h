@@ -48,6 +48,7 @@ public:
     std::optional<uint64> FindRoot(std::string_view) override { return std::nullopt; }
     std::map<std::string, uint64> Roots() override { return {}; }
     std::optional<uint64> FindCounter(std::string_view) override { return std::nullopt; }
+    std::map<std::string, uint64> Counters() override { return {}; }
     uint64 NextIdentity() override { return 1u << 20; }
     void Commit(const CommitBatch&) override { std::abort(); }
     void ForEachIdentity(const std::function<void(uint64)>& fn) override {

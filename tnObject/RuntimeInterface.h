@@ -6,10 +6,11 @@
 // The value types, the object model and the module are built before the
 // runtime and know nothing of it; where they need one of its services (a new
 // object's identity, a dirty mark, a reference to resolve, the thread's lock)
-// they call a function declared here. The library target tarn_runtime
-// (tnRuntime/) defines every one of them, and only those: a lower layer that
-// needs a further service declares it here first. Programs link the runtime
-// through the embedding API's target, which joins the module and the runtime.
+// they call a function declared here, and only these: the runtime's own
+// headers are out of their sight. The library target tarn_runtime
+// (tnRuntime/) defines every one of them; a lower layer that needs a further
+// service declares it here first. Programs link the runtime through the
+// embedding API's target, which joins the module and the runtime.
 //
 // Which file of tnRuntime/ defines what:
 //   memswap                                         MemSwap.cpp
