@@ -364,6 +364,19 @@ inline std::optional<uint64> ParseCount(std::string text) {
     std::exit(2);
 }
 
+// The positive count that follows the option at argv[i], stepping i onto it;
+// prints `usage` and exits when it is missing, not a count, or zero.
+inline uint64 NextCountArgument(int argc, char** argv, int& i, const char* usage) {
+    if (i + 1 >= argc) {
+        Usage(usage);
+    }
+    const std::optional<uint64> v = ParseCount(argv[++i]);
+    if (!v || *v == 0) {
+        Usage(usage);
+    }
+    return *v;
+}
+
 // The whole of a job program's main: runs `job`, and reports an exception
 // as one line on standard error and status 1.
 inline int RunJob(const char* program, int (*job)(int, char**), int argc, char** argv) {

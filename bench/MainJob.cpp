@@ -584,16 +584,7 @@ Config ParseArgs(int argc, char** argv) {
     if (haveRocksdb) {
         config.subjects.push_back("rocksdb");
     }
-    auto count = [&](int& i) {
-        if (i + 1 >= argc) {
-            Usage(kUsage);
-        }
-        const std::optional<uint64> v = ParseCount(argv[++i]);
-        if (!v || *v == 0) {
-            Usage(kUsage);
-        }
-        return *v;
-    };
+    auto count = [&](int& i) { return NextCountArgument(argc, argv, i, kUsage); };
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         if (arg == "--ops") {

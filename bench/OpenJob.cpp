@@ -548,16 +548,7 @@ Config ParseArgs(int argc, char** argv) {
             config.tool = (exe.parent_path().parent_path() / "tools" / "offsetops").string();
         }
     }
-    auto count = [&](int& i) {
-        if (i + 1 >= argc) {
-            Usage(kUsage);
-        }
-        const std::optional<uint64> v = ParseCount(argv[++i]);
-        if (!v || *v == 0) {
-            Usage(kUsage);
-        }
-        return *v;
-    };
+    auto count = [&](int& i) { return NextCountArgument(argc, argv, i, kUsage); };
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         if (arg == "--max-fields") {

@@ -1,10 +1,11 @@
 # The library is built as one static library per layer, and each layer sees
 # and links only the layers below it (README, "Layers"):
 #
-#   tarn_layer(NAME FOLDERS folder... [LINKS target...])
+#   tarn_layer(NAME FOLDERS folder... [LINKS target...] [PROVIDERS target...])
 #
 # compiles every .cpp under the folders into the static library NAME, linked
-# (PUBLIC) to LINKS. Includes are written from the repository root
+# (PUBLIC) to LINKS, and adds its link check (below); PROVIDERS are what the
+# layer calls without linking it (the runtime, for its interface). Includes are written from the repository root
 # ("tnUtils/Archive.h"), so the root itself is never an include directory of
 # a layer: each layer publishes its own folders alone, as symbolic links in
 # <build>/layers/NAME, and a source sees exactly the folders of its layer and
@@ -15,7 +16,7 @@
 # directory in __FILE__ (-fmacro-prefix-map), so that assertion messages name
 # them from the repository root, as the sources themselves are.
 function(tarn_layer name)
-    cmake_parse_arguments(PARSE_ARGV 1 layer "" "" "FOLDERS;LINKS")
+    cmake_parse_arguments(PARSE_ARGV 1 layer "" "" "FOLDERS;LINKS;PROVIDERS")
     set(sources)
     set(staging ${CMAKE_BINARY_DIR}/layers/${name})
     file(REMOVE_RECURSE ${staging})
@@ -36,22 +37,21 @@ function(tarn_layer name)
     # to these folders.
     set_property(TARGET ${name} PROPERTY TARN_FOLDERS ${layer_FOLDERS})
     set_property(GLOBAL APPEND PROPERTY TARN_LAYERS ${name})
+    tarn_layer_link_check(${name} ${layer_PROVIDERS})
 endfunction()
 
-# tarn_layer_link_check(NAME [PROVIDERS target...])
+# tarn_layer_link_check(NAME provider...)
 #
 # The build refuses a call against the order as it refuses an include: the
 # executable NAME_link_check holds every object of the layer NAME and links
-# only what NAME links, plus PROVIDERS (the runtime, for the layers below it
-# that call the runtime's interface, tnObject/RuntimeInterface.h). A function
+# only what NAME links, plus the providers (the runtime, for the layers below
+# it that call the runtime's interface, tnObject/RuntimeInterface.h). A function
 # that the layer calls and none of these defines is an undefined reference,
 # and the build stops there.
 function(tarn_layer_link_check name)
-    cmake_parse_arguments(PARSE_ARGV 1 check "" "" "PROVIDERS")
     set(check_target ${name}_link_check)
     add_executable(${check_target} ${CMAKE_SOURCE_DIR}/cmake/LinkCheck.cpp)
     target_link_options(${check_target} PRIVATE
         LINKER:--whole-archive $<TARGET_FILE:${name}> LINKER:--no-whole-archive)
-    target_link_libraries(${check_target} PRIVATE ${name} ${check_PROVIDERS})
-    add_dependencies(${check_target} ${name})
+    target_link_libraries(${check_target} PRIVATE ${name} ${ARGN})
 endfunction()
