@@ -27,7 +27,7 @@ foreach(header tnStore/OffsetOpsStore.h tnStore/FieldCursor.h tnStore/FieldTable
         message(FATAL_ERROR "the API header ${header} is not installed")
     endif()
 endforeach()
-foreach(header tnRuntime/CSpace.h tnStore/StoreImpl.h tnBackends/LmdbStore.h
+foreach(header tnRuntime/CSpace.h tnStore/OffsetOpsStoreImpl.h tnBackends/LmdbStore.h
                tnObject/RuntimeInterface.h tnOperation/src/WorkingSet/CompOp/OffsetOpsOnField.h)
     if(EXISTS ${prefix}/include/tarn/${header})
         message(FATAL_ERROR "the internal header ${header} is installed")

@@ -15,7 +15,7 @@ set(cases
     "tarn_module|tnOperation/src/WorkingSet/CompOp/OffsetOps.h|tnRuntime/CSpace.h,tnBackends/IStore.h,tnStore/OffsetOpsStore.h"
     "tarn_backends|tnBackends/LmdbStore.h|tnObject/IObject.h,tnRuntime/CSpace.h,tnStore/Journal.h"
     "tarn_runtime|tnRuntime/CSpace.h|tnOperation/src/WorkingSet/CompOp/OffsetOps.h,tnStore/OffsetOpsStore.h"
-    "tarn_api|tnStore/StoreImpl.h|tools/CommandTable.h,tests/StoreTestDir.h")
+    "tarn_api|tnStore/OffsetOpsStoreImpl.h|tools/CommandTable.h,tests/StoreTestDir.h")
 
 file(REMOVE_RECURSE ${WORK_DIR})
 file(MAKE_DIRECTORY ${WORK_DIR})

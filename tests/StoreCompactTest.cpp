@@ -7,6 +7,9 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <fstream>
+#include <regex>
+#include <sstream>
 
 #include "tests/StoreTables.h"
 #include "tests/StoreTestDir.h"
@@ -118,6 +121,19 @@ TEST_F(StoreCompact, ExplicitCompactWaitsForOtherProcessesToClose) {
     OffsetOpsStore reader = OffsetOpsStore::Open(m_dir, reading);
     EXPECT_TRUE(reader.Validate().Ok());
     EXPECT_EQ(reader.Find(Field(2))->size(), 2u);
+}
+
+// The README tells users when Close compacts: its figure is the default's.
+TEST(CompactionDocs, TheReadmeStatesTheDefaultFreeShare) {
+    std::ifstream in(std::string(TARN_TEST_DATA_DIR) + "/../../README.md");
+    ASSERT_TRUE(in.good());
+    std::ostringstream text;
+    text << in.rdbuf();
+    std::smatch m;
+    const std::string readme = text.str();
+    ASSERT_TRUE(std::regex_search(
+        readme, m, std::regex("`StoreOptions::compactFreeShare`, ([0-9.]+) by default")));
+    EXPECT_EQ(std::stod(m[1].str()), StoreOptions().compactFreeShare);
 }
 
 }  // namespace

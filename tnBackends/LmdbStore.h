@@ -136,7 +136,7 @@
 #include <utility>
 #include <vector>
 
-#include "tnBackends/IStore.h"
+#include "tnBackends/DiskStore.h"
 
 struct MDB_env;
 struct MDB_txn;
@@ -146,12 +146,6 @@ namespace tarn {
 
 struct LmdbStoreState;
 struct LmdbPageGuard;
-
-enum class OpenMode {
-    CreateIfMissing,  // make the directory and an empty store when there is none
-    MustExist,        // the directory must already hold a store
-    ReadOnly,         // an existing store, read as one snapshot beside any writer; Commit asserts
-};
 
 struct LmdbStoreOptions {
     static constexpr std::size_t kDefaultMapSize = std::size_t{1} << 30;
@@ -164,7 +158,7 @@ struct LmdbStoreOptions {
     std::size_t initialMapSize = kDefaultMapSize;
 };
 
-class LmdbStore : public IStore {
+class LmdbStore final : public DiskStore {
 public:
     static std::unique_ptr<LmdbStore> Open(const std::string& dir, OpenMode mode);
     static std::unique_ptr<LmdbStore> Open(const std::string& dir, const LmdbStoreOptions& options);
@@ -187,7 +181,7 @@ public:
     // The named counter as the latest commit holds it, also for a ReadOnly
     // store (whose other reads see its snapshot): a ReadOnly store reads and
     // verifies the latest meta record (or format-1 keys) for it.
-    std::optional<uint64> FindLatestCounter(std::string_view name);
+    std::optional<uint64> FindLatestCounter(std::string_view name) override;
     // Writes a copy of the environment as of the latest commit into the
     // existing directory `dir`, as its data.mdb (which must not exist yet),
     // synced. `compact` leaves out free pages and renumbers the rest, so the
@@ -214,17 +208,32 @@ public:
     // An opener that opened the old data.mdb just before the rename and then
     // waited for the lock sees one of the old file's two last commits: a
     // consistent, older snapshot, never a mix.
-    bool Compact();
+    bool Compact() override;
+    // The DiskStore words (tnBackends/DiskStore.h), in LmdbDiskStore.cpp:
+    // - FinishCheckpoint commits nothing: LMDB reuses the pages a commit
+    //   freed only from the second commit after it, so that the next
+    //   checkpoint writes over the pages this one freed instead of growing
+    //   the file by another copy of what it changes.
+    // - CopyTo is CopyTo below into a directory cleared of a failed earlier
+    //   copy's data.mdb and lock.mdb, reporting data.mdb's growth.
+    // - CheckFile is CheckLmdbPages of the directory; FileBytes data.mdb's
+    //   size; FreeShare the share of it DataBytes(true) leaves out.
+    void FinishCheckpoint() override;
+    DiskCopy CopyTo(const std::string& dir, bool compact, const CopyProgress& progress) override;
+    void CheckFile() override;
+    int64 FileBytes() override;
+    double FreeShare() override;
+
     // A reader that opened without a slot in LMDB's lock file (see Open).
     bool WithoutLock() const { return m_withoutLock; }
     // The bytes of the data file that the latest commit uses, or (when
     // `withoutFreePages`) about what a compacting copy of it takes.
     uint64 DataBytes(bool withoutFreePages = false);
 
-    const std::string& Directory() const { return m_dir; }
+    const std::string& Directory() const override { return m_dir; }
     // What opening repaired or changed (a lock file made anew, the store
     // upgraded from format 1), one line each.
-    const std::vector<std::string>& Repairs() const { return m_repairs; }
+    const std::vector<std::string>& Repairs() const override { return m_repairs; }
     // The store's format version as found when it was opened: 2, or 1 for a
     // store of the older format (which a writable opener has upgraded to 2;
     // see Repairs()). A store made by this opener is of version 2.

@@ -2,6 +2,8 @@
 
 #include <algorithm>
 
+#include "tnStore/OffsetOpsStoreImpl.h"
+
 namespace tarn {
 
 FieldCursor::FieldCursor(OffsetOpsStore& store, const FieldId& from, std::optional<FieldId> to)
@@ -14,7 +16,7 @@ bool FieldCursor::InRange(const FieldId& key) const {
 }
 
 void FieldCursor::Fill(BatchFrom from, const FieldId& key) {
-    std::vector<OffsetOpsStore::Entry> read = m_store->ReadBatch(from, key, kBatch);
+    std::vector<FieldEntry> read = ReadBatch(m_store->State(), from, key, kBatch);
     const bool backward = from != BatchFrom::AtOrAfter && from != BatchFrom::After;
     // The nearest entries come first: keep them while they are in range.
     std::size_t keep = 0;

@@ -28,6 +28,7 @@
 #include <optional>
 #include <vector>
 
+#include "tnStore/FieldBatch.h"
 #include "tnStore/OffsetOpsStore.h"
 #include "tnUtils/Assert.h"
 
@@ -65,8 +66,6 @@ public:
     void SeekToLast();
 
 private:
-    using BatchFrom = OffsetOpsStore::BatchFrom;
-
     // Reads the batch `from` says around `key`, keeps what is in range in
     // ascending order, and stands on its first (forward) or last entry.
     void Fill(BatchFrom from, const FieldId& key);
@@ -77,7 +76,7 @@ private:
     OffsetOpsStore* m_store;
     FieldId m_from;
     std::optional<FieldId> m_to;
-    std::vector<OffsetOpsStore::Entry> m_batch;
+    std::vector<FieldEntry> m_batch;
     std::size_t m_at = 0;  // m_batch.size(): at the end
 };
 

@@ -33,14 +33,13 @@
 // record) and syncs the file. A crash at any moment leaves exactly the
 // operations up to the last completed Sync(); opening replays the journal's
 // operations after the last checkpoint. A checkpoint writes the changed tree
-// nodes in one LMDB transaction together with the journal position they
-// cover. Checkpoints run at a durable point, never between two:
+// nodes in one transaction of the data file together with the journal
+// position they cover. Checkpoints run at a durable point, never between two:
 //   - when the journal has grown past StoreOptions::journalLimitBytes;
-//   - when StoreOptions::cacheObjects is set and changed nodes hold more
-//     objects in memory than it allows (between durable points the bound is
-//     kept by releasing clean nodes only; the changed nodes of operations that
-//     are not durable yet stay in memory until the next Sync);
 //   - on Checkpoint() and on Close().
+// The cache bound (StoreOptions::cacheObjects) never forces one: between
+// checkpoints, changed nodes leave memory for an overlay file of the
+// handle's own, which is not durable.
 // After a checkpoint the journal starts again, empty. A larger journal limit
 // means fewer tree writes per operation and a longer replay when opening
 // after a crash (about a million operations a second).
@@ -56,7 +55,7 @@
 // count, its keys in order and within the bounds its parent gives it. A
 // lookup, walk or write that meets a damaged node throws RuntimeError (a
 // writer's handle is then broken, see Failures). Check() and Validate() walk
-// the whole tree, the leaf chain and the kept counts; Dump and Clear run the
+// the whole tree, the leaf chain and the kept counts; Dump runs the
 // whole-tree check first.
 //
 // Failures. Every failure is an exception derived from RuntimeError
@@ -131,6 +130,7 @@ struct StoreOptions {
 };
 
 class FieldCursor;
+class OffsetOpsStoreImpl;
 
 // An operation Record refused, with nothing changed (category Refused).
 class RecordRefused : public RuntimeError {
@@ -370,24 +370,13 @@ public:
     // `height`.
     static ssize_t MinCacheObjects(ssize_t height);
 
-    struct Impl;
-
 private:
     friend class FieldCursor;
 
-    // Where a batch of entries is read: from the first field not less than
-    // the key, after it, before it, from it back, or from the end back (the
-    // key unused).
-    enum class BatchFrom { AtOrAfter, After, Before, AtOrBefore, End };
-    using Entry = std::pair<FieldId, FieldTable>;
-    // Up to `max` entries of those `from` says, the nearest to the key (or
-    // the end) first: ascending after the key, descending before it.
-    std::vector<Entry> ReadBatch(BatchFrom from, const FieldId& key, std::size_t max);
-
-    explicit OffsetOpsStore(std::unique_ptr<Impl> impl);
-    // The state of a handle that was not moved from.
-    Impl& Live() const;
-    std::unique_ptr<Impl> m_impl;
+    explicit OffsetOpsStore(std::unique_ptr<OffsetOpsStoreImpl> impl);
+    // The state of a handle that was not moved from; throws for one that was.
+    OffsetOpsStoreImpl& State() const;
+    std::unique_ptr<OffsetOpsStoreImpl> m_impl;
 };
 
 }  // namespace tarn

@@ -19,19 +19,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
-#include <chrono>
-#include <condition_variable>
 #include <filesystem>
 #include <limits>
-#include <mutex>
-#include <thread>
 #include <vector>
 
-#include "tnBackends/LmdbStore.h"
+#include "tnBackends/DiskStore.h"
 #include "tnStore/OffsetOpsStore.h"
-#include "tnStore/StoreImpl.h"
+#include "tnStore/OffsetOpsStoreImpl.h"
 #include "tnUtils/FileIo.h"
 #include "tnUtils/UniqueFd.h"
 
@@ -43,8 +38,6 @@ namespace fs = std::filesystem;
 
 // Copies started again because the writer checkpointed twice as one began.
 constexpr int kBackupAttempts = 8;
-
-constexpr auto kProgressInterval = std::chrono::milliseconds(200);
 
 [[noreturn]] void IoFailure(const std::string& path, const char* doing, int error) {
     throw RuntimeError(RuntimeError::CategoryOfErrno(error),
@@ -134,49 +127,6 @@ private:
     bool m_kept = false;
 };
 
-// Reports the growth of a file being written by someone else, from a thread
-// of its own, until destroyed.
-class FileGrowthReporter {
-public:
-    FileGrowthReporter(const BackupOptions::ProgressFn& report, std::string path, uint64 total)
-        : m_report(report), m_path(std::move(path)), m_total(total) {
-        if (m_report) {
-            m_thread = std::thread([this] { Run(); });
-        }
-    }
-    ~FileGrowthReporter() {
-        if (m_thread.joinable()) {
-            {
-                std::lock_guard lock(m_mutex);
-                m_done = true;
-            }
-            m_wake.notify_one();
-            m_thread.join();
-        }
-    }
-    FileGrowthReporter(const FileGrowthReporter&) = delete;
-    FileGrowthReporter& operator=(const FileGrowthReporter&) = delete;
-
-private:
-    void Run() {
-        std::unique_lock lock(m_mutex);
-        while (!m_wake.wait_for(lock, kProgressInterval, [this] { return m_done; })) {
-            struct stat st;
-            if (::stat(m_path.c_str(), &st) == 0) {
-                m_report(static_cast<uint64>(st.st_size), m_total);
-            }
-        }
-    }
-
-    const BackupOptions::ProgressFn& m_report;
-    std::string m_path;
-    uint64 m_total;
-    std::mutex m_mutex;
-    std::condition_variable m_wake;
-    bool m_done = false;
-    std::thread m_thread;
-};
-
 // Copies the first `bytes` bytes of the open file `fd` into a new file
 // `target`, synced.
 void CopyPrefix(int fd, const std::string& source, uint64 bytes, const std::string& target) {
@@ -230,9 +180,9 @@ RuntimeError AsSourceError(const std::string& dir, const fs::path& copy, const R
 // journals). Damage is reported as the source store's.
 uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
     try {
-        LmdbStoreOptions options;
+        DiskStoreOptions options;
         options.mode = OpenMode::ReadOnly;
-        std::unique_ptr<LmdbStore> copied = LmdbStore::Open(copy.string(), options);
+        std::unique_ptr<DiskStore> copied = OpenDiskStore(copy.string(), options);
         std::vector<uint64> identities;
         copied->ForEachIdentity([&](uint64 oid) { identities.push_back(oid); });
         // A key the walk finds and the lookup misses means damaged index
@@ -240,16 +190,15 @@ uint64 CheckCopy(const std::string& dir, const fs::path& copy) {
         for (uint64 oid : identities) {
             if (!copied->Load(oid)) {
                 throw RuntimeError(RuntimeError::Category::Damaged,
-                                   "LMDB store '" + copy.string() + "': image #" +
-                                       std::to_string(oid) +
+                                   "store '" + copy.string() + "': image #" + std::to_string(oid) +
                                        " is listed but cannot be looked up: its index is damaged");
             }
         }
         for (const auto& [name, oid] : copied->Roots()) {
             if (!copied->Load(oid)) {
                 throw RuntimeError(RuntimeError::Category::Damaged,
-                                   "LMDB store '" + copy.string() + "': root '" + name +
-                                       "' names #" + std::to_string(oid) + ", which has no image");
+                                   "store '" + copy.string() + "': root '" + name + "' names #" +
+                                       std::to_string(oid) + ", which has no image");
             }
         }
         return copied->FindCounter(kJournalPositionCounter).value_or(0);
@@ -271,7 +220,7 @@ void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
         options.mode = StoreMode::Read;
         options.cacheObjects = kCheckCacheObjects;
         OffsetOpsStore copied = OffsetOpsStore::Open(copy.string(), options);
-        const StoreValidation v = copied.Validate();  // LMDB's pages included
+        const StoreValidation v = copied.Validate();  // the file's structure included
         if (!v.check.Ok()) {
             throw RuntimeError(
                 RuntimeError::Category::Damaged,
@@ -284,31 +233,24 @@ void CheckCopyAsReader(const std::string& dir, const fs::path& copy) {
 }
 
 // Copies the data file and the journal of the store in `dir` (whose data
-// file `lmdb` has open) into `copy`. False when the writer checkpointed
+// file `disk` has open) into `copy`. False when the writer checkpointed
 // twice between opening the journal and starting the copy.
-bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
+bool TryCopy(DiskStore& disk, const std::string& dir, const fs::path& copy,
              const BackupOptions& options, BackupResult& result) {
     const std::string journalPath = (fs::path(dir) / Journal::kFileName).string();
     std::error_code ec;
     std::optional<UniqueFd> journal;
     if (fs::exists(journalPath, ec) ||
-        lmdb.FindLatestCounter(kJournalPositionCounter).has_value()) {
+        disk.FindLatestCounter(kJournalPositionCounter).has_value()) {
         journal.emplace(Journal::OpenForReading(journalPath));
     }
-    const fs::path data = copy / "data.mdb";
     const fs::path journalCopy = copy / Journal::kFileName;
-    for (const fs::path& stale : {data, copy / "lock.mdb", journalCopy}) {
-        fs::remove(stale, ec);
-    }
-    {
-        FileGrowthReporter reporter(options.progress, data.string(),
-                                    lmdb.DataBytes(options.compact));
-        lmdb.CopyTo(copy.string(), options.compact);
-    }
+    fs::remove(journalCopy, ec);  // left by an earlier attempt
+    const DiskCopy copied = disk.CopyTo(copy.string(), options.compact, options.progress);
     const uint64 checkpoint = CheckCopy(dir, copy);
     result.checkpointedOperations = checkpoint;
     result.durableOperations = checkpoint;
-    result.dataBytes = FileBytes(data);
+    result.dataBytes = copied.dataBytes;
     result.journalBytes = 0;
     if (!journal) {
         return true;  // a store made before journals: its data file is all of it
@@ -328,7 +270,7 @@ bool TryCopy(LmdbStore& lmdb, const std::string& dir, const fs::path& copy,
     return true;
 }
 
-BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::string& to,
+BackupResult BackupWith(DiskStore& disk, const std::string& dir, const std::string& to,
                         const BackupOptions& options) {
     if (to.empty()) {
         throw RuntimeError(RuntimeError::Category::Refused, "a backup needs a target directory");
@@ -352,7 +294,7 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
     }
     PartialCopy copy(target);
     BackupResult result;
-    for (int attempt = 1; !TryCopy(lmdb, dir, copy.Path(), options, result); ++attempt) {
+    for (int attempt = 1; !TryCopy(disk, dir, copy.Path(), options, result); ++attempt) {
         if (attempt == kBackupAttempts) {
             throw RuntimeError(RuntimeError::Category::InUse,
                                "no backup made: in " + std::to_string(kBackupAttempts) +
@@ -370,20 +312,21 @@ BackupResult BackupWith(LmdbStore& lmdb, const std::string& dir, const std::stri
 
 BackupResult OffsetOpsStore::Backup(const std::filesystem::path& from,
                                     const std::filesystem::path& to, const BackupOptions& options) {
-    LmdbStoreOptions lmdbOptions;
-    lmdbOptions.mode = OpenMode::ReadOnly;
-    std::unique_ptr<LmdbStore> lmdb = LmdbStore::Open(from.string(), lmdbOptions);
-    return BackupWith(*lmdb, from.string(), to.string(), options);
+    DiskStoreOptions reading;
+    reading.mode = OpenMode::ReadOnly;
+    std::unique_ptr<DiskStore> disk = OpenDiskStore(from.string(), reading);
+    return BackupWith(*disk, from.string(), to.string(), options);
 }
 
 BackupResult OffsetOpsStore::Backup(const std::filesystem::path& to, const BackupOptions& options) {
-    Impl& s = Live();
-    s.RequireOpen();
-    if (s.lmdb == nullptr) {
+    OffsetOpsStoreImpl& handle = State();
+    handle.RequireOpen();
+    DiskStore* disk = handle.Tree().Disk();
+    if (disk == nullptr) {
         throw RuntimeError(RuntimeError::Category::Refused,
                            "an in-memory store cannot be backed up");
     }
-    return BackupWith(*s.lmdb, s.dir, to.string(), options);
+    return BackupWith(*disk, handle.Dir(), to.string(), options);
 }
 
 }  // namespace tarn

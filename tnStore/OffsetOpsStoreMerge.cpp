@@ -9,7 +9,7 @@
 #include <limits>
 
 #include "tnStore/OffsetOpsStore.h"
-#include "tnStore/StoreImpl.h"
+#include "tnStore/OffsetOpsStoreImpl.h"
 
 namespace tarn {
 
@@ -35,23 +35,17 @@ int64 StepToward(int64 sum, int64 target) {
 
 }  // namespace
 
-std::map<Guid, int64> OffsetOpsStore::Sites() {
-    Impl& s = Live();
-    s.RequireOpen();
-    return s.bounds.Newest();
-}
-
 MergeResult OffsetOpsStore::Merge(const std::filesystem::path& fromDir,
                                   const MergeOptions& options) {
     const std::string from = fromDir.string();
-    Impl& s = Live();
+    OffsetOpsStoreImpl& handle = State();
     if (options.dryRun) {
-        s.RequireOpen();
+        handle.RequireOpen();
     } else {
-        s.RequireWritable();
+        handle.RequireWritable();
     }
     std::error_code ec;
-    if (!s.dir.empty() && std::filesystem::equivalent(s.dir, from, ec)) {
+    if (!handle.Dir().empty() && std::filesystem::equivalent(handle.Dir(), from, ec)) {
         throw RuntimeError(RuntimeError::Category::Refused,
                            "store '" + from + "' cannot be merged into itself");
     }

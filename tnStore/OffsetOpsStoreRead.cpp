@@ -1,17 +1,15 @@
 // The reading half of the API: lookups, ordered walks, statistics, checks
 // and the dump.
 
-#include <deque>
 #include <memory>
 #include <tuple>
 #include <utility>
 
-#include "tnBackends/LmdbFileCheck.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
+#include "tnStore/FieldBatch.h"
 #include "tnStore/OffsetOpsStore.h"
+#include "tnStore/OffsetOpsStoreImpl.h"
 #include "tnStore/Reachability.h"
-#include "tnStore/StoreImpl.h"
-#include "tnStore/TreeWalk.h"
 #include "tnUtils/OstreamOutputStream.h"
 #include "tnUtils/xostream.h"
 
@@ -24,6 +22,8 @@ namespace {
 // call the store, and a bounded cache stays bounded between batches.
 constexpr std::size_t kWalkBatch = 256;
 
+using MapCheck = FieldIdToOffsetOpsOnInt64FieldMapCheckResult;
+
 FieldTable TableOf(const OffsetOpsOnField<int64>& table) {
     FieldTable records;
     records.reserve(table.m_map.getmap().size());
@@ -33,77 +33,122 @@ FieldTable TableOf(const OffsetOpsOnField<int64>& table) {
     return records;
 }
 
+// The map's non-aborting check, within the cache bound. Exclusive.
+MapCheck CheckMap(OffsetOpsStoreImpl& handle) {
+    return FieldIdToOffsetOpsOnInt64FieldMapCheck(handle.Tree().Map(),
+                                                  [&] { handle.Memory().KeepUnder(); });
+}
+
+StoreCheck AsStoreCheck(MapCheck&& check) {
+    StoreCheck result;
+    result.problems = std::move(check.problems);
+    result.numProblems = check.numProblems;
+    return result;
+}
+
+void AddProblem(MapCheck& check, std::string problem) {
+    if (check.problems.size() < static_cast<std::size_t>(check.kMaxProblems)) {
+        check.problems.push_back(std::move(problem));
+    }
+    ++check.numProblems;
+}
+
+// The counts the store keeps (and opening and stats trust) against what the
+// walk found.
+void CompareKeptCounts(OffsetOpsStoreImpl& handle, MapCheck& check) {
+    const auto [leaves, internalNodes] = handle.Tree().NodeCounts();
+    const auto compare = [&](const char* what, int64 kept, int64 found) {
+        if (kept != found) {
+            AddProblem(check, std::string("the store keeps a count of ") + std::to_string(kept) +
+                                  " " + what + ", the tree has " + std::to_string(found));
+        }
+    };
+    compare("leaves", leaves, check.leaves);
+    compare("internal nodes", internalNodes, check.internalNodes);
+    compare("fields", handle.Tree().Map().size(), check.entries);
+}
+
+// The map's own validation, which stops the process on a broken invariant,
+// so it runs only on a tree that passed the check. Within a cache bound it
+// is left out: it holds the whole tree in memory, and the check covers its
+// invariants. Exclusive.
+bool ValidateMap(OffsetOpsStoreImpl& handle, MapCheck& check) {
+    if (!check.Ok()) {
+        return false;
+    }
+    if (handle.Memory().On()) {
+        return true;
+    }
+    const FieldIdToOffsetOpsOnInt64FieldMap& map = handle.Tree().Map();
+    map.Validate();
+    const ssize_t counted = map.GetNumNodes();
+    if (counted != check.Nodes()) {
+        AddProblem(check, "the map counts " + std::to_string(counted) + " nodes, the walk found " +
+                              std::to_string(check.Nodes()));
+        return false;
+    }
+    return true;
+}
+
+// The stored images no root reaches. They are those of the store as it is
+// (a reader's snapshot, a writer's last checkpoint), so they are counted in
+// a second space over the same store, which holds no operation of the
+// journal.
+void FindUnreachable(OffsetOpsStoreImpl& handle, StoreValidation& v) {
+    CSpace stored(handle.Tree().SharedStore());
+    CSpaceGuard guard(stored, LockMode::Exclusive);
+    ReachabilityResult reach = FindUnreachableImages(stored, handle.Memory().Objects());
+    v.images = reach.stored;
+    v.reached = reach.reached;
+    v.unreachable = std::move(reach.unreachable);
+    for (std::string& e : reach.errors) {
+        v.check.problems.push_back(std::move(e));
+        ++v.check.numProblems;
+    }
+}
+
 }  // namespace
 
-StoreCheck CheckTree(OffsetOpsStore::Impl& s) {
-    const ssize_t bound = s.options.cacheObjects;
-    FieldIdToOffsetOpsOnInt64FieldMapCheckResult result =
-        FieldIdToOffsetOpsOnInt64FieldMapCheck(s.Map(), [&] {
-            s.NotePeak();
-            KeepResidentsUnder(*s.space, bound);
-        });
-    StoreCheck check;
-    check.problems = std::move(result.problems);
-    check.numProblems = result.numProblems;
-    return check;
-}
-
-void RequireSoundTree(OffsetOpsStore::Impl& s) {
-    const StoreCheck check = CheckTree(s);
-    if (!check.Ok()) {
-        throw RuntimeError(RuntimeError::Category::Damaged,
-                           "store '" + s.dir + "': the stored tree is damaged (" +
-                               std::to_string(check.numProblems) + " problems; the first: " +
-                               check.problems.front() + "); run 'offsetops validate' for all");
-    }
-}
-
-std::optional<FieldTable> OffsetOpsStore::Find(const FieldId& field) {
-    Impl& s = Live();
-    s.RequireOpen();
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    s.MakeRoom();
-    const OffsetOpsOnField<int64>* table = s.Map().rFind(field);
-    if (table == nullptr) {
-        return std::nullopt;
-    }
-    return TableOf(*table);
-}
-
-// Entries are copied with the space held; the caller uses them without it,
-// so it may even call the store, and a bounded cache stays bounded between
-// batches.
-std::vector<OffsetOpsStore::Entry> OffsetOpsStore::ReadBatch(BatchFrom from, const FieldId& key,
-                                                             std::size_t max) {
-    Impl& s = Live();
-    s.RequireOpen();
-    std::vector<Entry> batch;
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    s.MakeRoom();
-    const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
-    if (from == BatchFrom::AtOrAfter || from == BatchFrom::After) {
-        auto it = from == BatchFrom::AtOrAfter ? map.lower_bound(key) : map.upper_bound(key);
-        for (; it != map.end() && batch.size() < max; ++it) {
+std::vector<FieldEntry> ReadBatch(OffsetOpsStoreImpl& handle, BatchFrom from, const FieldId& key,
+                                  std::size_t max) {
+    return handle.Reading([&] {
+        handle.Memory().MakeRoomForOperation();
+        std::vector<FieldEntry> batch;
+        const FieldIdToOffsetOpsOnInt64FieldMap& map = handle.Tree().Map();
+        if (from == BatchFrom::AtOrAfter || from == BatchFrom::After) {
+            auto it = from == BatchFrom::AtOrAfter ? map.lower_bound(key) : map.upper_bound(key);
+            for (; it != map.end() && batch.size() < max; ++it) {
+                batch.emplace_back(it->first, TableOf(it->second));
+            }
+            return batch;
+        }
+        auto it = from == BatchFrom::Before       ? map.lower_bound(key)
+                  : from == BatchFrom::AtOrBefore ? map.upper_bound(key)
+                                                  : map.end();
+        while (it != map.begin() && batch.size() < max) {
+            --it;
             batch.emplace_back(it->first, TableOf(it->second));
         }
         return batch;
-    }
-    auto it = from == BatchFrom::Before       ? map.lower_bound(key)
-              : from == BatchFrom::AtOrBefore ? map.upper_bound(key)
-                                              : map.end();
-    while (it != map.begin() && batch.size() < max) {
-        --it;
-        batch.emplace_back(it->first, TableOf(it->second));
-    }
-    return batch;
+    });
+}
+
+std::optional<FieldTable> OffsetOpsStore::Find(const FieldId& field) {
+    OffsetOpsStoreImpl& handle = State();
+    return handle.Reading([&]() -> std::optional<FieldTable> {
+        handle.Memory().MakeRoomForOperation();
+        const OffsetOpsOnField<int64>* table = handle.Tree().Map().rFind(field);
+        if (table == nullptr) {
+            return std::nullopt;
+        }
+        return TableOf(*table);
+    });
 }
 
 void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
-    std::vector<Entry> batch = ReadBatch(BatchFrom::AtOrAfter, from, kWalkBatch);
+    std::vector<FieldEntry> batch = ReadBatch(State(), BatchFrom::AtOrAfter, from, kWalkBatch);
     for (;;) {
-        for (const Entry& e : batch) {
+        for (const FieldEntry& e : batch) {
             if (!fn(e.first, e.second)) {
                 return;
             }
@@ -112,7 +157,7 @@ void OffsetOpsStore::ForEachFrom(const FieldId& from, const FieldVisitor& fn) {
             return;
         }
         const FieldId last = batch.back().first;
-        batch = ReadBatch(BatchFrom::After, last, kWalkBatch);
+        batch = ReadBatch(State(), BatchFrom::After, last, kWalkBatch);
     }
 }
 
@@ -123,162 +168,99 @@ void OffsetOpsStore::ForEachOfObject(OID oid, const FieldVisitor& fn) {
 }
 
 int64 OffsetOpsStore::Size() {
-    Impl& s = Live();
-    s.RequireOpen();
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    return s.Map().size();
+    OffsetOpsStoreImpl& handle = State();
+    return handle.Reading([&] { return handle.Tree().Map().size(); });
 }
 
 ssize_t OffsetOpsStore::Height() {
-    Impl& s = Live();
-    s.RequireOpen();
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    return s.Map().m_height;
+    OffsetOpsStoreImpl& handle = State();
+    return handle.Reading([&] { return handle.Tree().Map().m_height; });
+}
+
+std::map<Guid, int64> OffsetOpsStore::Sites() {
+    OffsetOpsStoreImpl& handle = State();
+    handle.RequireOpen();
+    return handle.Recording().Bounds().Newest();
 }
 
 StoreStatistics OffsetOpsStore::Stats() {
-    Impl& s = Live();
-    s.RequireOpen();
-    StoreStatistics stats;
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    stats.fields = s.Map().size();
-    stats.height = s.Map().m_height;
-    std::tie(stats.leaves, stats.internalNodes) = s.NodeCounts();
-    const StoreStats stored = s.store->Stats();
-    stats.images = stored.numImages;
-    stats.imageBytes = stored.numImageBytes;
-    stats.journalBytes =
-        static_cast<int64>(s.journal != nullptr ? s.journal->FileBytes() : s.journalBytes);
-    stats.durableOperations = s.durable;
-    stats.checkpointedOperations = s.checkpointed;
-    stats.pendingOperations = s.pending;
-    stats.checkpoints = s.checkpoints;
-    stats.imagesWritten = s.store->ImagesWritten();
-    stats.imageBytesWritten = s.store->BytesWritten();
-    stats.residents = s.space->NumResidents();
-    s.NotePeak();
-    stats.peakResidents = s.peakResidents;
-    stats.replayedOperations = s.replayed;
-    return stats;
+    OffsetOpsStoreImpl& handle = State();
+    return handle.Reading([&] {
+        TreeSpace& tree = handle.Tree();
+        const Checkpointer& checkpoints = handle.Checkpoints();
+        StoreStatistics stats;
+        stats.fields = tree.Map().size();
+        stats.height = tree.Map().m_height;
+        std::tie(stats.leaves, stats.internalNodes) = tree.NodeCounts();
+        const StoreStats stored = tree.Store().Stats();
+        stats.images = stored.numImages;
+        stats.imageBytes = stored.numImageBytes;
+        stats.journalBytes = static_cast<int64>(checkpoints.JournalBytes());
+        stats.durableOperations = checkpoints.Durable();
+        stats.checkpointedOperations = checkpoints.Checkpointed();
+        stats.pendingOperations = checkpoints.Pending();
+        stats.checkpoints = checkpoints.Count();
+        stats.imagesWritten = tree.Store().ImagesWritten();
+        stats.imageBytesWritten = tree.Store().BytesWritten();
+        stats.residents = tree.Space().NumResidents();
+        stats.peakResidents = handle.Memory().Peak();
+        stats.replayedOperations = handle.Opening().replayed;
+        return stats;
+    });
 }
 
 StoreCheck OffsetOpsStore::Check() {
-    Impl& s = Live();
-    s.RequireOpen();
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    StoreCheck check = CheckTree(s);
-    if (s.options.cacheObjects > 0) {
-        s.space->EvictCleanResidents(s.options.cacheObjects / 2);
-    }
-    return check;
+    OffsetOpsStoreImpl& handle = State();
+    return handle.Reading([&] {
+        StoreCheck check = AsStoreCheck(CheckMap(handle));
+        handle.Memory().Trim();
+        return check;
+    });
 }
 
-namespace {
-
-void AddProblem(FieldIdToOffsetOpsOnInt64FieldMapCheckResult& check, std::string problem) {
-    if (check.problems.size() < static_cast<std::size_t>(check.kMaxProblems)) {
-        check.problems.push_back(std::move(problem));
-    }
-    ++check.numProblems;
-}
-
-// The counts the store keeps (and opening and stats trust) against what the
-// walk found.
-void CompareKeptCounts(OffsetOpsStore::Impl& s,
-                       FieldIdToOffsetOpsOnInt64FieldMapCheckResult& check) {
-    const auto [leaves, internalNodes] = s.NodeCounts();
-    const auto compare = [&](const char* what, int64 kept, int64 found) {
-        if (kept != found) {
-            AddProblem(check, std::string("the store keeps a count of ") + std::to_string(kept) +
-                                  " " + what + ", the tree has " + std::to_string(found));
-        }
-    };
-    compare("leaves", leaves, check.leaves);
-    compare("internal nodes", internalNodes, check.internalNodes);
-    compare("fields", s.Map().size(), check.entries);
-}
-
-}  // namespace
-
-// The unreachable images are those of the store as it is (a reader's
-// snapshot, a writer's last checkpoint), so they are counted in a second
-// space over the same store, which holds no operation of the journal.
-// Within a cache bound the map's own validation is left out: it holds the
-// whole tree in memory, and the check above covers its invariants.
 StoreValidation OffsetOpsStore::Validate() {
-    Impl& s = Live();
-    s.RequireOpen();
-    StoreValidation v;
-    const ssize_t bound = s.options.cacheObjects;
-    {
-        CSpaceGuard guard(*s.space, LockMode::Exclusive);
-        s.ApplyDeferred();
-        v.record = s.record->m_oid;
-        v.map = s.Record().m_map.m_oid;
-        const FieldIdToOffsetOpsOnInt64FieldMap& map = s.Map();
-        FieldIdToOffsetOpsOnInt64FieldMapCheckResult check =
-            FieldIdToOffsetOpsOnInt64FieldMapCheck(map, [&] {
-                s.NotePeak();
-                KeepResidentsUnder(*s.space, bound);
-            });
+    OffsetOpsStoreImpl& handle = State();
+    StoreValidation v = handle.Reading([&] {
+        StoreValidation found;
+        found.record = handle.Tree().RecordOid();
+        found.map = handle.Tree().Record().m_map.m_oid;
+        MapCheck check = CheckMap(handle);
         if (check.Ok()) {
-            CompareKeptCounts(s, check);
+            CompareKeptCounts(handle, check);
         }
-        if (check.Ok() && bound > 0) {
-            v.mapValid = true;
-        } else if (check.Ok()) {
-            // The map's own checker stops the process on a broken invariant,
-            // so it runs only on a tree that passed the check above.
-            map.Validate();
-            v.mapValid = true;
-            const ssize_t counted = map.GetNumNodes();
-            if (counted != check.Nodes()) {
-                AddProblem(check, "the map counts " + std::to_string(counted) +
-                                      " nodes, the walk found " + std::to_string(check.Nodes()));
-                v.mapValid = false;
-            }
-        }
-        v.check.problems = std::move(check.problems);
-        v.check.numProblems = check.numProblems;
-        if (s.options.cacheObjects > 0) {
-            s.space->EvictCleanResidents(s.options.cacheObjects / 2);
-        }
-    }
-    if (!s.dir.empty()) {
-        // LMDB's own pages: opening reads only those on the paths it takes.
+        found.mapValid = ValidateMap(handle, check);
+        found.check = AsStoreCheck(std::move(check));
+        handle.Memory().Trim();
+        return found;
+    });
+    if (DiskStore* disk = handle.Tree().Disk()) {
+        // The file's own structure: opening and lookups read only the parts
+        // on the paths they take.
         try {
-            CheckLmdbPages(s.dir);
+            disk->CheckFile();
         } catch (const RuntimeError& e) {
             v.check.problems.push_back(e.what());
             ++v.check.numProblems;
         }
     }
-    CSpace stored(s.store);
-    CSpaceGuard guard(stored, LockMode::Exclusive);
-    ReachabilityResult reach = FindUnreachableImages(stored, bound);
-    v.images = reach.stored;
-    v.reached = reach.reached;
-    v.unreachable = std::move(reach.unreachable);
-    for (std::string& e : reach.errors) {
-        v.check.problems.push_back(std::move(e));
-        ++v.check.numProblems;
-    }
+    FindUnreachable(handle, v);
     return v;
 }
 
 void OffsetOpsStore::Dump(std::ostream& out) {
-    Impl& s = Live();
-    s.RequireOpen();
-    CSpaceGuard guard(*s.space, LockMode::Exclusive);
-    s.ApplyDeferred();
-    RequireSoundTree(s);
-    OstreamOutputStream sink(out);
-    xostream os(sink);
-    s.Map().Write(os);
+    OffsetOpsStoreImpl& handle = State();
+    handle.Reading([&] {
+        const StoreCheck check = AsStoreCheck(CheckMap(handle));
+        if (!check.Ok()) {
+            throw RuntimeError(RuntimeError::Category::Damaged,
+                               "store '" + handle.Dir() + "': the stored tree is damaged (" +
+                                   std::to_string(check.numProblems) + " problems; the first: " +
+                                   check.problems.front() + "); run 'offsetops validate' for all");
+        }
+        OstreamOutputStream sink(out);
+        xostream os(sink);
+        handle.Tree().Map().Write(os);
+    });
 }
 
 }  // namespace tarn

@@ -46,18 +46,18 @@ void SetTreeSummary(CSpace& space, const RefusalBounds& bounds) {
     }
 }
 
-void RebuildTreeSummary(OffsetOpsStore::Impl& s) {
-    s.bounds.Clear();
+void RebuildTreeSummary(TreeSpace& tree, ssize_t bound, RefusalBounds& bounds) {
+    bounds.Clear();
     const TreeShape shape =
-        WalkTree(*s.space, s.Record().m_map.m_oid, s.options.cacheObjects,
+        WalkTree(tree.Space(), tree.Record().m_map.m_oid, bound,
                  [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
                      for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
                          for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                             s.bounds.NoteStored(site, so);
+                             bounds.NoteStored(site, so);
                          }
                      }
                  });
-    CSpace& space = *s.space;
+    CSpace& space = tree.Space();
     const auto set = [&](const ReflectedClass& rc, int64 n) {
         space.SetCounter(CSpace::PopulationCounter(rc.m_name), static_cast<uint64>(n));
     };
@@ -65,7 +65,7 @@ void RebuildTreeSummary(OffsetOpsStore::Impl& s) {
     set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMap>(), 1);
     set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>(), shape.leaves);
     set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>(), shape.internalNodes);
-    SetTreeSummary(space, s.bounds);
+    SetTreeSummary(space, bounds);
 }
 
 }  // namespace tarn

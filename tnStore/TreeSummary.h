@@ -13,7 +13,8 @@
 //                          table any more, after Clear)
 
 #include "tnRuntime/CSpace.h"
-#include "tnStore/StoreImpl.h"
+#include "tnStore/RefusalBounds.h"
+#include "tnStore/TreeSpace.h"
 
 namespace tarn {
 
@@ -21,9 +22,9 @@ namespace tarn {
 bool LoadTreeSummary(const CSpace& space, RefusalBounds& bounds);
 // Sets the summary's counters for the next commit. Exclusive.
 void SetTreeSummary(CSpace& space, const RefusalBounds& bounds);
-// For a store from before summaries: walks the stored tree (within the cache
-// bound) for the bounds and the node counts, and sets the counters for the
-// next commit. Exclusive.
-void RebuildTreeSummary(OffsetOpsStore::Impl& s);
+// For a store from before summaries: walks the stored tree (keeping at most
+// `bound` objects in memory, 0: no bound) for the bounds and the node counts, and sets the counters
+// for the next commit. Exclusive.
+void RebuildTreeSummary(TreeSpace& tree, ssize_t bound, RefusalBounds& bounds);
 
 }  // namespace tarn
