@@ -92,7 +92,7 @@ constexpr uint64 kNearlyFullBytes = uint64{1} << 20;
 
 [[noreturn]] void Fail(const std::string& dir, const std::string& what,
                        RuntimeError::Category category = RuntimeError::Category::Damaged) {
-    throw RuntimeError(category, "LMDB store '" + dir + "': " + what);
+    throw RuntimeError(category, "store '" + dir + "': " + what);
 }
 
 // After a failed File::ReadAt of `name`.

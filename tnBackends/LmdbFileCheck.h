@@ -10,7 +10,7 @@
 // and turn such files into a RuntimeError (or, for a lock file nobody uses, a
 // repair) before LMDB sees them. The branch and leaf pages are not read at
 // opening: CheckLmdbPages reads them all, for callers that validate a whole
-// store or a copy of it. Every message starts with "LMDB store '<dir>': ", as
+// store or a copy of it. Every message starts with "store '<dir>': ", as
 // the store's own do.
 
 #include <optional>

@@ -228,7 +228,7 @@ struct MapFull {};
 
 [[noreturn]] void FailAt(const std::string& dir, const std::string& what,
                          RuntimeError::Category category = RuntimeError::Category::Other) {
-    throw RuntimeError(category, "LMDB store '" + dir + "': " + what);
+    throw RuntimeError(category, "store '" + dir + "': " + what);
 }
 
 MDB_val Val(const void* data, std::size_t size) {
@@ -545,7 +545,7 @@ int LmdbStore::Touch(const MDB_val& val) const noexcept {
 // throw the same error. What can be aborted is aborted as the error unwinds
 // (a write transaction, a read scope); nothing is committed.
 void LmdbStore::PageFault(const char* doing, const LmdbPageGuard& guard) {
-    const std::string damaged = "LMDB store '" + m_dir + "': damaged store: ";
+    const std::string damaged = "store '" + m_dir + "': damaged store: ";
     const std::uintptr_t address = guard.faultAddress;
     const std::string signal = guard.faultSignal == SIGBUS ? "SIGBUS" : "SIGSEGV";
     if (guard.faultSignal == 0) {
@@ -1578,7 +1578,7 @@ void LmdbStore::Check(int rc, std::string_view doing) {
     }
     if (rc == MDB_PAGE_NOTFOUND || rc == MDB_CORRUPTED || rc == MDB_CURSOR_FULL ||
         rc == kPastTheMap) {
-        m_poisoned = "LMDB store '" + m_dir + "': damaged store: " + std::string(doing) + ": " +
+        m_poisoned = "store '" + m_dir + "': damaged store: " + std::string(doing) + ": " +
                      (rc == kPastTheMap ? "LMDB places a key or value past the end of its map"
                                         : mdb_strerror(rc));
         throw RuntimeError(RuntimeError::Category::Damaged, m_poisoned);

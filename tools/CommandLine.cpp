@@ -41,16 +41,6 @@ int Usage(std::ostream& err, const UsageError& e) {
     return kUsageStatus;
 }
 
-// The store's messages in the program's words: the store is the user's, not
-// LMDB's.
-std::string InStoreWords(std::string message) {
-    const std::string lmdb = "LMDB store '";
-    for (std::size_t at; (at = message.find(lmdb)) != std::string::npos;) {
-        message.replace(at, lmdb.size(), "store '");
-    }
-    return message;
-}
-
 // Runs what the arguments ask for; throws UsageError for wrong ones.
 int Dispatch(const std::vector<std::string>& args, const CommandDecl*& command, Io& io) {
     if (args.empty()) {
@@ -102,7 +92,7 @@ int RunOffsetOps(int argc, const char* const* argv, std::ostream& out, std::ostr
     } catch (const UsageError& e) {
         return Usage(err, e);
     } catch (const RuntimeError& e) {
-        err << "offsetops: " << InStoreWords(e.what()) << '\n';
+        err << "offsetops: " << e.what() << '\n';
     } catch (const std::bad_alloc&) {
         err << "offsetops: out of memory\n";
     } catch (const std::exception& e) {
