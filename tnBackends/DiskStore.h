@@ -54,8 +54,7 @@ public:
     // directory `dir`, replacing any of the store's own files a failed
     // earlier copy left there, synced. `compact` leaves out free space.
     // Runs beside the writer; the copy holds one commit.
-    virtual DiskCopy CopyTo(const std::string& dir, bool compact,
-                            const CopyProgress& progress) = 0;
+    virtual DiskCopy CopyTo(const std::string& dir, bool compact, const CopyProgress& progress) = 0;
     // Writers: rewrites the file without its free space and puts it in place
     // of the old one, when no other process has the store open. False,
     // changing nothing, when another process has it open.

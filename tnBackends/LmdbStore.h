@@ -113,7 +113,7 @@
 //   them, and trusts them. Damage it detects itself (MDB_PAGE_NOTFOUND,
 //   MDB_CORRUPTED, MDB_CURSOR_FULL), and a SIGSEGV or SIGBUS inside the map (or
 //   at a null pointer), or one of LMDB's assertions, while it reads a page
-//   (caught by a page guard: see LmdbStore.cpp; the first Open installs a
+//   (caught by a page guard: see LmdbInternal.h; the first Open installs a
 //   process-wide handler for both signals, chained to the one before it),
 //   arrive as a RuntimeError "damaged store: ..." and poison the store: every
 //   later call throws the same error and nothing more is committed. A writer
@@ -249,10 +249,20 @@ private:
     LmdbStore(std::string dir, const LmdbStoreOptions& options);
 
     void LockDirectory();
+    void UnlockDirectory();
     void OpenEnvironment();
     void FindMap();
     void SetMapSize(std::size_t size, const char* doing);
     void OpenDatabases(OpenMode mode);
+    void OpenDatabasesForReading();
+    bool OpenMetaDatabase(MDB_txn* txn);
+    void OpenImagesDatabase(MDB_txn* txn);
+    void CreateDatabases(MDB_txn* txn);
+    void UpgradeFormat1(MDB_txn* txn, LmdbStoreState& state,
+                        const std::vector<std::string>& oldKeys);
+    void PutImage(MDB_txn* txn, uint64 oid, const StoredImage& image, LmdbStoreState& next);
+    void DeleteImage(MDB_txn* txn, uint64 oid, LmdbStoreState& next);
+    void SetNamedValues(const CommitBatch& batch, LmdbStoreState& next);
     void BeginSnapshot();
     LmdbStoreState ReadState(MDB_txn* txn, uint32* version, std::vector<std::string>* oldKeys);
     LmdbStoreState ReadFormat1(MDB_txn* txn, std::vector<std::string>* oldKeys);
