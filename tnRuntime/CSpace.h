@@ -242,6 +242,8 @@ private:
         bool subTree;
     };
     using ObjectSet = std::unordered_set<const void*>;
+    // Objects a commit writes, with their identities.
+    using DirtyObjects = std::vector<std::pair<uint64, ptr<IPersistable>>>;
 
     void RequireExclusive() const;
     ptr<IPersistable> Load(OID oid, const ReflectedClass* expected);
@@ -251,6 +253,10 @@ private:
     ptr<IPersistable> FlaggedResident(const Queued& entry, int flag) const;
     void ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& doomedSet,
                          std::map<std::string, int64, std::less<>>& expandedDelta);
+    DirtyObjects DirtyToWrite(const ObjectSet& doomedSet) const;
+    CommitBatch MakeBatch(const DirtyObjects& dirty, const std::vector<ptr<IPersistable>>& doomed,
+                          const std::map<std::string, int64, std::less<>>& expandedDelta);
+    void ClearCommitted(const DirtyObjects& dirty, const std::vector<ptr<IPersistable>>& doomed);
     // The population counters a commit stores: every class whose count
     // changed, with `expandedDelta` (the subtree deletions it expanded).
     void AddPopulationCounters(CommitBatch& batch,

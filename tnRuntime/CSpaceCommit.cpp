@@ -89,16 +89,27 @@ void CSpace::ExpandDeletions(std::vector<ptr<IPersistable>>& doomed, ObjectSet& 
 // An exception in steps 1-4 leaves the space and the store unchanged.
 void CSpace::Commit() {
     RequireExclusive();
-
     std::vector<ptr<IPersistable>> doomed;
     ObjectSet doomedSet;
     std::map<std::string, int64, std::less<>> expandedDelta;
     ExpandDeletions(doomed, doomedSet, expandedDelta);
+    const DirtyObjects dirty = DirtyToWrite(doomedSet);
+    m_store->Commit(MakeBatch(dirty, doomed, expandedDelta));
+    ClearCommitted(dirty, doomed);
+    if (!doomed.empty()) {
+        UnbindReferencesTo(doomedSet);
+        DestroyDeleted(doomed);
+    }
+    if (m_residentBound > 0 && NumResidents() > m_residentBound) {
+        EvictCleanResidents(m_residentBound - m_residentBound / 4);
+    }
+}
 
-    // The dirty objects in identity order. Each has one live entry: the
-    // flag is set once per queueing and cleared only by a commit or when the
-    // object leaves the space.
-    std::vector<std::pair<uint64, ptr<IPersistable>>> dirty;
+// The dirty objects in identity order, but for those being deleted. Each
+// has one live entry: the flag is set once per queueing and cleared only by
+// a commit or when the object leaves the space.
+CSpace::DirtyObjects CSpace::DirtyToWrite(const ObjectSet& doomedSet) const {
+    DirtyObjects dirty;
     dirty.reserve(m_dirty.size());
     for (const Queued& entry : m_dirty) {
         ptr<IPersistable> obj = FlaggedResident(entry, DBP_PO_DIRTY);
@@ -108,9 +119,15 @@ void CSpace::Commit() {
     }
     std::sort(dirty.begin(), dirty.end(),
               [](const auto& a, const auto& b) { return a.first < b.first; });
+    return dirty;
+}
 
-    // Images are made one at a time as the store takes them, so that a
-    // commit of the whole tree holds one image in memory, not all of them.
+// Steps 2 and 3. Images are made one at a time as the store takes them, so
+// that a commit of the whole tree holds one image in memory, not all of
+// them; the batch refers to `dirty`, which must outlive it.
+CommitBatch CSpace::MakeBatch(const DirtyObjects& dirty,
+                              const std::vector<ptr<IPersistable>>& doomed,
+                              const std::map<std::string, int64, std::less<>>& expandedDelta) {
     CommitBatch batch;
     batch.streamedWrites = [&dirty](const CommitBatch::ImageSink& sink) {
         MemoryOutputStream bytes;
@@ -136,11 +153,14 @@ void CSpace::Commit() {
     batch.counters.insert(m_pendingCounters.begin(), m_pendingCounters.end());
     AddPopulationCounters(batch, expandedDelta);
     batch.nextIdentity = m_nextIdentity;
+    return batch;
+}
 
-    m_store->Commit(batch);
-
-    // Every dirty object was written or is deleted below, and every queued
-    // deletion was expanded: the queues start afresh.
+// Step 5, before the deleted objects go: every dirty object was written or
+// is deleted, and every queued deletion was expanded, so the flags are
+// cleared and the queues start afresh.
+void CSpace::ClearCommitted(const DirtyObjects& dirty,
+                            const std::vector<ptr<IPersistable>>& doomed) {
     for (const auto& [oid, obj] : dirty) {
         ObjSysState& state = obj->GetSysState();
         state.ClearFlag(DBP_PO_DIRTY);
@@ -160,14 +180,6 @@ void CSpace::Commit() {
     m_populationDelta.clear();
     ++m_stats.numCommits;
     m_stats.numWritten += static_cast<int64>(dirty.size());
-
-    if (!doomed.empty()) {
-        UnbindReferencesTo(doomedSet);
-        DestroyDeleted(doomed);
-    }
-    if (m_residentBound > 0 && NumResidents() > m_residentBound) {
-        EvictCleanResidents(m_residentBound - m_residentBound / 4);
-    }
 }
 
 void CSpace::AddPopulationCounters(CommitBatch& batch,

@@ -291,17 +291,30 @@ JournalScan Journal::Scan(const std::string& path, uint64 from, const EntryFn& a
     return Scan(fd.Get(), path, from, apply);
 }
 
-JournalScan Journal::Scan(int fd, const std::string& path, uint64 from, const EntryFn& apply) {
-    struct stat st;
-    if (::fstat(fd, &st) != 0) {
-        IoError(path, "stat", errno);
-    }
-    FileReader reader(fd, path, static_cast<uint64>(st.st_size));
-    if (reader.Size() < kHeaderBytes) {
+namespace {
+
+// The fields of a record header that passed its checksum and magic.
+struct RecordHeader {
+    uint64 length = 0;
+    uint64 first = 0;
+    uint64 count = 0;
+    uint64 checksum = 0;
+};
+
+// What reading a record at a position found.
+enum class RecordRead {
+    Whole,        // a complete record whose checksums hold
+    TornTail,     // the torn tail: the scan ends here
+    CutMeanwhile  // the file was cut while read: look again at what is left
+};
+
+// Checks the file header; returns the sequence number of the first entry.
+uint64 ReadFileHeader(FileReader& reader, const std::string& path) {
+    if (reader.Size() < Journal::kHeaderBytes) {
         Damage(path, 0,
                "the file is " + std::to_string(reader.Size()) + " bytes, shorter than its header");
     }
-    const octet_t* header = reader.Get(0, kHeaderBytes);
+    const octet_t* header = reader.Get(0, Journal::kHeaderBytes);
     if (header == nullptr) {
         Damage(path, 0, "the file was cut while being read");
     }
@@ -315,86 +328,123 @@ JournalScan Journal::Scan(int fd, const std::string& path, uint64 from, const En
     if (GetLe(header + 24, 8) != XXH3_64bits(header, 24)) {
         Damage(path, 24, "header checksum mismatch");
     }
+    return GetLe(header + 16, 8);
+}
 
+// The fields of the record header `h` at `pos`, checked against the limits
+// and against `expectedFirst`, the entry that must come next.
+RecordHeader CheckRecordHeader(const octet_t* h, const std::string& path, uint64 pos,
+                               uint64 expectedFirst) {
+    if (std::memcmp(h, kRecordMagic, sizeof kRecordMagic) != 0) {
+        Damage(path, pos, "bad record magic");
+    }
+    const RecordHeader header{GetLe(h + 4, 4), GetLe(h + 8, 8), GetLe(h + 16, 4), GetLe(h + 24, 8)};
+    if (header.length > Journal::kMaxPayload) {
+        Damage(path, pos,
+               "record payload of " + std::to_string(header.length) + " bytes over the limit");
+    }
+    if (header.count == 0) {
+        Damage(path, pos, "record holds no entries");
+    }
+    if (header.first != expectedFirst) {
+        Damage(path, pos,
+               "record starts at entry " + std::to_string(header.first) + ", expected " +
+                   std::to_string(expectedFirst));
+    }
+    if (header.count > std::numeric_limits<uint64>::max() - header.first) {
+        Damage(path, pos, "record's entry numbers overflow");
+    }
+    return header;
+}
+
+// Reads the record at `pos` into `header` and `payload`, telling a torn tail
+// (see Journal.h) from damage, which throws.
+RecordRead ReadRecord(FileReader& reader, const std::string& path, uint64 pos, uint64 expectedFirst,
+                      RecordHeader& header, const octet_t*& payload) {
+    const uint64 left = reader.Size() - pos;
+    if (left < Journal::kRecordHeaderBytes) {
+        return RecordRead::TornTail;  // shorter than a record header
+    }
+    const octet_t* h = reader.Get(pos, Journal::kRecordHeaderBytes);
+    if (h == nullptr) {
+        return RecordRead::CutMeanwhile;
+    }
+    if (GetLe(h + 20, 4) != RecordHeaderChecksum(h)) {
+        if (AllZeros(reader, pos + Journal::kRecordHeaderBytes, reader.Size())) {
+            return RecordRead::TornTail;  // a header that never made it, zeros after it
+        }
+        Damage(path, pos, "record header checksum mismatch");
+    }
+    header = CheckRecordHeader(h, path, pos, expectedFirst);
+    if (header.length > left - Journal::kRecordHeaderBytes) {
+        return RecordRead::TornTail;  // the payload runs past the end of the file
+    }
+    const octet_t* record = reader.Get(pos, Journal::kRecordHeaderBytes + header.length);
+    if (record == nullptr) {
+        return RecordRead::CutMeanwhile;
+    }
+    payload = record + Journal::kRecordHeaderBytes;
+    if (XXH3_64bits_withSeed(payload, header.length, header.first) != header.checksum) {
+        if (header.length == left - Journal::kRecordHeaderBytes) {
+            return RecordRead::TornTail;  // the last record, its payload not all written
+        }
+        Damage(path, pos + Journal::kRecordHeaderBytes, "record payload checksum mismatch");
+    }
+    return RecordRead::Whole;
+}
+
+// Decodes and checks every entry of a whole record, then applies those
+// numbered `from` or later.
+void ApplyRecord(const std::string& path, uint64 payloadPos, const RecordHeader& header,
+                 const octet_t* payload, uint64 from, const Journal::EntryFn& apply) {
+    JournalEntry entry;
+    PayloadDecoder decoder(path, payloadPos, payload, header.length);
+    for (uint64 i = 0; i < header.count; ++i) {
+        decoder.Next<false>(entry);
+    }
+    if (!decoder.AtEnd()) {
+        decoder.Fail(std::to_string(decoder.Left()) + " bytes after the record's " +
+                     std::to_string(header.count) + " entries");
+    }
+    if (from >= header.first + header.count) {
+        return;
+    }
+    decoder.Restart();
+    for (uint64 i = 0; i < header.count; ++i) {
+        if (header.first + i < from) {
+            decoder.Next<false>(entry);
+        } else {
+            decoder.Next<true>(entry);
+            apply(header.first + i, entry);
+        }
+    }
+}
+
+}  // namespace
+
+JournalScan Journal::Scan(int fd, const std::string& path, uint64 from, const EntryFn& apply) {
+    struct stat st;
+    if (::fstat(fd, &st) != 0) {
+        IoError(path, "stat", errno);
+    }
+    FileReader reader(fd, path, static_cast<uint64>(st.st_size));
     JournalScan scan;
-    scan.base = GetLe(header + 16, 8);
+    scan.base = ReadFileHeader(reader, path);
     scan.end = scan.base;
     uint64 pos = kHeaderBytes;
-    JournalEntry entry;
     while (pos < reader.Size()) {
-        const uint64 left = reader.Size() - pos;
-        if (left < kRecordHeaderBytes) {
-            break;  // torn: shorter than a record header
+        RecordHeader header;
+        const octet_t* payload = nullptr;
+        const RecordRead read = ReadRecord(reader, path, pos, scan.end, header, payload);
+        if (read == RecordRead::TornTail) {
+            break;
         }
-        const octet_t* h = reader.Get(pos, kRecordHeaderBytes);
-        if (h == nullptr) {
-            continue;  // cut meanwhile: look again at what is left
-        }
-        if (GetLe(h + 20, 4) != RecordHeaderChecksum(h)) {
-            if (AllZeros(reader, pos + kRecordHeaderBytes, reader.Size())) {
-                break;  // torn: a header that never made it, zeros after it
-            }
-            Damage(path, pos, "record header checksum mismatch");
-        }
-        if (std::memcmp(h, kRecordMagic, sizeof kRecordMagic) != 0) {
-            Damage(path, pos, "bad record magic");
-        }
-        const uint64 length = GetLe(h + 4, 4);
-        const uint64 first = GetLe(h + 8, 8);
-        const uint64 count = GetLe(h + 16, 4);
-        const uint64 checksum = GetLe(h + 24, 8);
-        if (length > kMaxPayload) {
-            Damage(path, pos,
-                   "record payload of " + std::to_string(length) + " bytes over the limit");
-        }
-        if (count == 0) {
-            Damage(path, pos, "record holds no entries");
-        }
-        if (first != scan.end) {
-            Damage(path, pos,
-                   "record starts at entry " + std::to_string(first) + ", expected " +
-                       std::to_string(scan.end));
-        }
-        if (count > std::numeric_limits<uint64>::max() - first) {
-            Damage(path, pos, "record's entry numbers overflow");
-        }
-        if (length > left - kRecordHeaderBytes) {
-            break;  // torn: the payload runs past the end of the file
-        }
-        const octet_t* record = reader.Get(pos, kRecordHeaderBytes + length);
-        if (record == nullptr) {
+        if (read == RecordRead::CutMeanwhile) {
             continue;
         }
-        const octet_t* payload = record + kRecordHeaderBytes;
-        if (XXH3_64bits_withSeed(payload, length, first) != checksum) {
-            if (length == left - kRecordHeaderBytes) {
-                break;  // torn: the last record, its payload not all written
-            }
-            Damage(path, pos + kRecordHeaderBytes, "record payload checksum mismatch");
-        }
-
-        // Check the whole record, then apply the entries asked for.
-        PayloadDecoder decoder(path, pos + kRecordHeaderBytes, payload, length);
-        for (uint64 i = 0; i < count; ++i) {
-            decoder.Next<false>(entry);
-        }
-        if (!decoder.AtEnd()) {
-            decoder.Fail(std::to_string(decoder.Left()) + " bytes after the record's " +
-                         std::to_string(count) + " entries");
-        }
-        if (from < first + count) {
-            decoder.Restart();
-            for (uint64 i = 0; i < count; ++i) {
-                if (first + i < from) {
-                    decoder.Next<false>(entry);
-                } else {
-                    decoder.Next<true>(entry);
-                    apply(first + i, entry);
-                }
-            }
-        }
-        pos += kRecordHeaderBytes + length;
-        scan.end = first + count;
+        ApplyRecord(path, pos + kRecordHeaderBytes, header, payload, from, apply);
+        pos += kRecordHeaderBytes + header.length;
+        scan.end = header.first + header.count;
     }
     scan.validBytes = pos;
     scan.fileBytes = reader.Size();
