@@ -19,6 +19,7 @@ TEST(ToolCliTest, NeedsTheTools) {
 #include <spawn.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cctype>
 #include <memory>
 #include <sstream>
@@ -347,27 +348,50 @@ TEST(ToolFormats, ShowStatsDiffValidateAndSitesInTextJsonAndCsv) {
     EXPECT_TRUE(ParseJson(same.out).items.empty());
 }
 
-// The writer of JSON escapes what needs it; CSV quotes what needs it.
-TEST(ToolFormats, JsonAndCsvTextIsEscaped) {
+// The output layer: a summary and a listing in each format, with text that
+// JSON must escape (quotes, control characters, bytes that are not UTF-8)
+// and CSV must quote; a JSON element a line.
+TEST(ToolFormats, ReportsEscapeQuoteAndLayOutEachFormat) {
     const std::string tricky = std::string("a\"b\\c\nd\te\x01") + "f\xff" + "\xc3\xa9";
-    const Json parsed = ParseJson(tool::JsonQuoted(tricky));
-    EXPECT_EQ(parsed.text, std::string("a\"b\\c\nd\te\x01") + "f\xEF\xBF\xBD" + "\xc3\xa9");
-    std::ostringstream out;
-    tool::JsonWriter json(out);
-    json.BeginObject();
-    json.Member("k\"ey", "v");
-    json.Key("list");
-    json.BeginArray();
-    json.Number(-9223372036854775807 - 1);
-    json.BeginObject();
-    json.EndObject();
-    json.EndArray();
-    json.EndObject();
-    const Json doc = ParseJson(out.str());
-    EXPECT_EQ(doc["k\"ey"].text, "v");
-    EXPECT_EQ(doc["list"].items[0].text, "-9223372036854775808");
-    EXPECT_EQ(tool::CsvField("plain"), "plain");
-    EXPECT_EQ(tool::CsvField("a,\"b\""), "\"a,\"\"b\"\"\"");
+    tool::Summary summary;
+    summary.Value("count", int64{-9223372036854775807 - 1}, "count")
+        .Value("name", tricky)
+        .TextRow("name", "tricky")
+        .List("problems", "problem", "problem: ", {"x,\"y\"", "z"})
+        .TextLine("valid");
+    std::ostringstream json;
+    summary.Write(json, tool::Format::Json);
+    const std::string document = json.str();
+    const Json doc = ParseJson(document);
+    EXPECT_EQ(doc["count"].text, "-9223372036854775808");
+    EXPECT_EQ(doc["name"].text, std::string("a\"b\\c\nd\te\x01") + "f\xEF\xBF\xBD" + "\xc3\xa9");
+    EXPECT_EQ(doc["problems"].items.size(), 2u);
+    EXPECT_EQ(std::count(document.begin(), document.end(), '\n'), 5);  // {, 3 members, }
+    std::ostringstream csv;
+    summary.Write(csv, tool::Format::Csv);
+    EXPECT_EQ(csv.str(), "name,value\ncount,-9223372036854775808\nname,\"" +
+                             std::string("a\"\"b\\c\nd\te\x01") +
+                             "f\xff\xc3\xa9\"\nproblem,\"x,\"\"y\"\"\"\nproblem,z\n");
+    std::ostringstream text;
+    summary.Write(text, tool::Format::Text);
+    EXPECT_THAT(text.str(), MatchesRegex("count +-9223372036854775808\nname +tricky\n"
+                                         "problem: x,\"y\"\nproblem: z\nvalid\n"));
+
+    for (const tool::Format format : {tool::Format::Text, tool::Format::Json, tool::Format::Csv}) {
+        std::ostringstream out;
+        tool::Listing listing(out, format, "site,t");
+        listing.Item(tool::Json{{"site", "s,1"}, {"t", 5}});
+        listing.Item(tool::Json{{"site", "s2"}, {"t", 6}});
+        listing.End("note");
+        const std::string expected[] = {
+            "s,1 5\ns2 6\n(note)\n",
+            "[\n{\"site\":\"s,1\",\"t\":5},\n{\"site\":\"s2\",\"t\":6}\n]\n",
+            "site,t\n\"s,1\",5\ns2,6\n"};
+        EXPECT_EQ(out.str(), expected[static_cast<int>(format)]);
+    }
+    std::ostringstream empty;
+    tool::Listing(empty, tool::Format::Json, "").End();
+    EXPECT_EQ(empty.str(), "[]\n");
 }
 
 // ---------------------------------------------------------------------------

@@ -31,59 +31,42 @@ struct DiffCounts {
 //   csv   change,field,store,site,t,o: a row per site record of each side
 class DiffPrinter {
 public:
-    DiffPrinter(std::ostream& out, Format format) : m_out(out), m_format(format), m_json(out) {
-        if (m_format == Format::Json) {
-            m_json.BeginArray();
-        } else if (m_format == Format::Csv) {
-            m_out << "change,field,store,site,t,o\n";
-        }
-    }
+    DiffPrinter(std::ostream& out, Format format)
+        : m_listing(out, format, "change,field,store,site,t,o") {}
 
     void Print(Change change, const FieldId& key, const FieldTable* a, const FieldTable* b) {
         static const char* const kText[] = {"< ", "> ", "! "};
         static const char* const kName[] = {"only-a", "only-b", "other"};
         const int index = static_cast<int>(change);
-        switch (m_format) {
-            case Format::Text:
-                m_out << kText[index] << ToString(key) << " --> " << ToString(a ? *a : *b);
-                if (a && b) {
-                    m_out << ' ' << ToString(*b);
-                }
-                m_out << '\n';
-                break;
-            case Format::Json:
-                m_json.BeginObject();
-                m_json.Member("change", kName[index]);
-                m_json.Member("field", ToString(key));
-                for (const auto& [name, table] : {std::pair{"a", a}, std::pair{"b", b}}) {
+        const std::pair<const char*, const FieldTable*> sides[] = {{"a", a}, {"b", b}};
+        m_listing.Item(
+            [&] {
+                Json item{{"change", kName[index]}, {"field", ToString(key)}};
+                for (const auto& [name, table] : sides) {
                     if (table != nullptr) {
-                        m_json.Key(name);
-                        WriteTable(m_json, *table);
+                        item[name] = TableJson(*table);
                     }
                 }
-                m_json.EndObject();
-                break;
-            case Format::Csv:
-                for (const auto& [name, table] : {std::pair{"a", a}, std::pair{"b", b}}) {
+                return item;
+            },
+            [&] {
+                for (const auto& [name, table] : sides) {
                     for (const SiteRecord& r : table ? *table : FieldTable{}) {
-                        m_out << kName[index] << ',' << CsvField(ToString(key)) << ',' << name
-                              << ',' << ToString(r.site) << ',' << r.t << ',' << r.o << '\n';
+                        m_listing.Row({kName[index], ToString(key), name, ToString(r.site),
+                                       std::to_string(r.t), std::to_string(r.o)});
                     }
                 }
-                break;
-        }
+            },
+            [&] {
+                return kText[index] + ToString(key) + " --> " + ToString(a ? *a : *b) +
+                       (a && b ? " " + ToString(*b) : std::string());
+            });
     }
 
-    void End() {
-        if (m_format == Format::Json) {
-            m_json.EndArray();
-        }
-    }
+    void End() { m_listing.End(); }
 
 private:
-    std::ostream& m_out;
-    Format m_format;
-    JsonWriter m_json;
+    Listing m_listing;
 };
 
 DiffCounts Compare(OffsetOpsStore& a, OffsetOpsStore& b, bool progressWanted, Format format,

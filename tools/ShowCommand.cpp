@@ -50,51 +50,30 @@ ShowQuery ShowQueryOf(const Arguments& args) {
 //   csv   field,site,t,o and a row per site of each field
 class FieldPrinter {
 public:
-    FieldPrinter(std::ostream& out, Format format) : m_out(out), m_format(format), m_json(out) {
-        if (m_format == Format::Json) {
-            m_json.BeginArray();
-        } else if (m_format == Format::Csv) {
-            m_out << "field,site,t,o\n";
-        }
-    }
+    FieldPrinter(std::ostream& out, Format format) : m_listing(out, format, "field,site,t,o") {}
 
     void Field(const FieldId& key, const FieldTable& table) {
-        switch (m_format) {
-            case Format::Text:
-                m_out << ToString(key) << " --> " << ToString(table) << '\n';
-                break;
-            case Format::Json:
-                m_json.BeginObject();
-                m_json.Member("field", ToString(key));
-                m_json.Key("oid");
-                m_json.Unsigned(key.oid.value_);
-                m_json.Member("path", PathHex(key.path));
-                m_json.Key("table");
-                WriteTable(m_json, table);
-                m_json.EndObject();
-                break;
-            case Format::Csv:
+        m_listing.Item(
+            [&] {
+                return Json{{"field", ToString(key)},
+                            {"oid", key.oid.value_},
+                            {"path", PathHex(key.path)},
+                            {"table", TableJson(table)}};
+            },
+            [&] {
                 for (const SiteRecord& r : table) {
-                    m_out << CsvField(ToString(key)) << ',' << ToString(r.site) << ',' << r.t << ','
-                          << r.o << '\n';
+                    m_listing.Row({ToString(key), ToString(r.site), std::to_string(r.t),
+                                   std::to_string(r.o)});
                 }
-                break;
-        }
+            },
+            [&] { return ToString(key) + " --> " + ToString(table); });
     }
 
     // Ends the list; `note` (text only) says what a limit left out.
-    void End(const std::string& note) {
-        if (m_format == Format::Json) {
-            m_json.EndArray();
-        } else if (m_format == Format::Text && !note.empty()) {
-            m_out << "(" << note << ")\n";
-        }
-    }
+    void End(const std::string& note) { m_listing.End(note); }
 
 private:
-    std::ostream& m_out;
-    Format m_format;
-    JsonWriter m_json;
+    Listing m_listing;
 };
 
 int RunShow(const Arguments& args, Io& io) {

@@ -15,25 +15,11 @@ int RunSites(const Arguments& args, Io& io) {
     const std::string dir = args.Store();
     const Format format = args.OutputFormat();
     OffsetOpsStore store = OpenAndReport(dir, StoreMode::Read, io.err);
-    JsonWriter json(io.out);
-    if (format == Format::Json) {
-        json.BeginArray();
-    } else if (format == Format::Csv) {
-        io.out << "site,t\n";
-    }
+    Listing listing(io.out, format, "site,t");
     for (const auto& [site, newest] : store.Sites()) {
-        if (format == Format::Json) {
-            json.BeginObject();
-            json.Member("site", ToString(site));
-            json.Member("t", newest);
-            json.EndObject();
-        } else {
-            io.out << ToString(site) << (format == Format::Csv ? ',' : ' ') << newest << '\n';
-        }
+        listing.Item(Json{{"site", ToString(site)}, {"t", newest}});
     }
-    if (format == Format::Json) {
-        json.EndArray();
-    }
+    listing.End();
     return io.out.flush() ? 0 : OutputFailed(io.err, kFailed);
 }
 

@@ -8,10 +8,70 @@ namespace tarn::tool {
 
 namespace {
 
-// What validate found, in the three formats:
+// The problems validate reports: the check's (with a count of those it did
+// not keep), the map's own validation, and the images no root reaches.
+struct Problems {
+    std::vector<std::string> lines;
+    int64 count = 0;
+};
+
+std::string UnreachableText(const std::vector<uint64>& unreachable) {
+    std::string list;
+    for (std::size_t i = 0; i < unreachable.size() && i < 10; ++i) {
+        list += (i == 0 ? "#" : ", #") + std::to_string(unreachable[i]);
+    }
+    if (unreachable.size() > 10) {
+        list += ", ...";
+    }
+    return Counted(static_cast<int64>(unreachable.size()), "image", "images") +
+           " that no root reaches: " + list;
+}
+
+Problems ProblemsOf(const StoreValidation& v) {
+    Problems problems{v.check.problems, v.check.numProblems};
+    const auto kept = static_cast<int64>(problems.lines.size());
+    if (problems.count > kept) {
+        problems.lines.push_back("(and " + std::to_string(problems.count - kept) + " more)");
+    }
+    if (v.check.Ok() && !v.mapValid) {
+        problems.lines.push_back("the map's own validation failed");
+        ++problems.count;
+    }
+    if (!v.unreachable.empty()) {
+        problems.lines.push_back(UnreachableText(v.unreachable));
+        ++problems.count;
+    }
+    return problems;
+}
+
+// What validate found (tools/Report.h):
 //   text  "label   value" rows, a "problem: ..." line each, then valid or invalid
 //   json  {"valid":..,"record":..,"map":..,"fields":..,...,"problems":[..]}
 //   csv   name,value rows, a problem row each
+Summary ValidationSummary(const StoreValidation& v, const std::optional<StoreStatistics>& stats,
+                          const Problems& problems) {
+    Summary summary;
+    summary.Value("valid", problems.count == 0)
+        .TextRow("record", ToString(v.record) + " (map " + ToString(v.map) + ")")
+        .Value("record", ToString(v.record))
+        .Value("map", ToString(v.map));
+    if (stats) {
+        summary.Value("fields", stats->fields, "fields")
+            .Value("height", static_cast<int64>(stats->height), "height")
+            .TextRow("nodes", NodesText(*stats))
+            .Value("leaves", stats->leaves)
+            .Value("internal_nodes", stats->internalNodes);
+    }
+    summary
+        .Value("images", v.images, "images",
+               std::to_string(v.images) + " (" + std::to_string(v.reached) + " reached from roots)")
+        .Value("reached", v.reached)
+        .JsonOnly("problem_count", problems.count)
+        .List("problems", "problem", "problem: ", problems.lines)
+        .TextLine(problems.count > 0 ? "invalid" : "valid");
+    return summary;
+}
+
 int RunValidate(const Arguments& args, Io& io) {
     const std::string dir = args.Store();
     const ssize_t cacheObjects = args.CacheNodes(kDefaultWalkCacheObjects);
@@ -22,89 +82,18 @@ int RunValidate(const Arguments& args, Io& io) {
     }
     OffsetOpsStore& store = *walkable;
     const StoreValidation v = store.Validate();
-    std::vector<std::string> problems = v.check.problems;
-    int64 numProblems = v.check.numProblems;
-    if (numProblems > static_cast<int64>(problems.size())) {
-        problems.push_back(
-            "(and " + std::to_string(numProblems - static_cast<int64>(problems.size())) + " more)");
-    }
     std::optional<StoreStatistics> stats;
     if (v.check.Ok()) {
         stats = store.Stats();
-        if (!v.mapValid) {
-            problems.push_back("the map's own validation failed");
-            ++numProblems;
-        }
     }
-    if (!v.unreachable.empty()) {
-        std::string list;
-        for (std::size_t i = 0; i < v.unreachable.size() && i < 10; ++i) {
-            list += (i == 0 ? "#" : ", #") + std::to_string(v.unreachable[i]);
-        }
-        if (v.unreachable.size() > 10) {
-            list += ", ...";
-        }
-        problems.push_back(Counted(static_cast<int64>(v.unreachable.size()), "image", "images") +
-                           " that no root reaches: " + list);
-        ++numProblems;
-    }
-
-    if (format == Format::Text) {
-        Row(io.out, "record", ToString(v.record) + " (map " + ToString(v.map) + ")");
-        if (stats) {
-            Row(io.out, "fields", std::to_string(stats->fields));
-            Row(io.out, "height", std::to_string(stats->height));
-            Row(io.out, "nodes", NodesText(*stats));
-        }
-        Row(io.out, "images",
-            std::to_string(v.images) + " (" + std::to_string(v.reached) + " reached from roots)");
-        for (const std::string& p : problems) {
-            io.out << "problem: " << p << '\n';
-        }
-        io.out << (numProblems > 0 ? "invalid\n" : "valid\n");
-    } else if (format == Format::Json) {
-        JsonWriter json(io.out);
-        json.BeginObject();
-        json.Key("valid");
-        json.Bool(numProblems == 0);
-        json.Member("record", ToString(v.record));
-        json.Member("map", ToString(v.map));
-        if (stats) {
-            json.Member("fields", stats->fields);
-            json.Member("height", static_cast<int64>(stats->height));
-            json.Member("leaves", stats->leaves);
-            json.Member("internal_nodes", stats->internalNodes);
-        }
-        json.Member("images", v.images);
-        json.Member("reached", v.reached);
-        json.Member("problem_count", numProblems);
-        json.Key("problems");
-        json.BeginArray();
-        for (const std::string& p : problems) {
-            json.String(p);
-        }
-        json.EndArray();
-        json.EndObject();
-    } else {
-        io.out << "name,value\n"
-               << "valid," << (numProblems == 0 ? "true" : "false") << '\n'
-               << "record," << ToString(v.record) << '\n'
-               << "map," << ToString(v.map) << '\n';
-        if (stats) {
-            io.out << "fields," << stats->fields << "\nheight," << stats->height << "\nleaves,"
-                   << stats->leaves << "\ninternal_nodes," << stats->internalNodes << '\n';
-        }
-        io.out << "images," << v.images << "\nreached," << v.reached << '\n';
-        for (const std::string& p : problems) {
-            io.out << "problem," << CsvField(p) << '\n';
-        }
-    }
+    const Problems problems = ProblemsOf(v);
+    ValidationSummary(v, stats, problems).Write(io.out, format);
     if (!io.out.flush()) {
         return OutputFailed(io.err, kFailed);
     }
-    if (numProblems > 0) {
+    if (problems.count > 0) {
         return Fail(io.err, "validation of '" + dir +
-                                "' failed: " + Counted(numProblems, "problem", "problems"));
+                                "' failed: " + Counted(problems.count, "problem", "problems"));
     }
     return 0;
 }
