@@ -1,20 +1,32 @@
 #pragma once
 
-// Shared pieces of the job programs (MainJob, GrowthJob, RecoveryJob): plain
-// programs that run every case in a child process of its own, so that the
-// peak resident memory and the bytes written to disk belong to that case
-// alone, and that print tables rather than Google Benchmark output.
+// Shared pieces of the job programs (MainJob, GrowthJob, RecoveryJob,
+// OpenJob): plain programs that run every case in a child process of its
+// own, so that the peak resident memory and the bytes written to disk belong
+// to that case alone, and that print tables rather than Google Benchmark
+// output.
 //
-//   RunInChild(fn)      forks; the child runs fn and sends its trivially
-//                       copyable result back through a pipe
+//   Now()               seconds on the steady clock
 //   WriteBytes()        /proc/self/io write_bytes: bytes this process caused
 //                       to be written to the storage layer (page-cache pages
 //                       it dirtied, all threads included)
-//   PeakRssKiB()        getrusage(RUSAGE_SELF).ru_maxrss
 //   CurrentRssKiB()     VmRSS of /proc/self/status
 //   CpuSeconds()        getrusage(RUSAGE_SELF) user + system time
+//   PeakRssKiB()        getrusage(RUSAGE_SELF).ru_maxrss
 //   DirBytes(dir)       the sum of the sizes of the regular files under dir
+//   RemoveDir(dir)      removes dir and everything in it
+//   FileSystemKind()    the kind of file system a path lies on, and
+//   MachineLine()       the machine's cores and load: the tables' headers
+//   DefaultStoreRoot()  where stores go unless a --dir says otherwise
+//   RunInChild(fn)      forks; the child runs fn and sends its trivially
+//                       copyable result (or the error that ended it) back
+//                       through a pipe
 //   OpStream            the generated stream of offset operations
+//   MakeSites(n)        the n site identities of a stream
+//   SplitList, ParseCount, NextCountArgument, Usage
+//                       reading the programs' arguments
+//   RunJob()            a program's main: an exception becomes one line and
+//                       status 1
 //
 // A forked child starts with the parent's resident set as its peak, so the
 // parents of these programs keep their memory small (nothing big is built
@@ -158,7 +170,7 @@ inline std::string MachineLine() {
 }
 
 // A directory for stores next to the running program (that is, in the
-// build tree), made if missing.
+// build tree); the caller makes it.
 inline std::string DefaultStoreRoot(const char* leaf) {
     std::error_code ec;
     std::filesystem::path exe = std::filesystem::read_symlink("/proc/self/exe", ec);

@@ -341,7 +341,7 @@ CommandDecl RecordCommand() {
              "a durable point after every K operations (1 to " + std::to_string(kMaxCommitEvery) +
                  ", default " + std::to_string(kDefaultCommitEvery) + ")"},
             {"--cache-nodes", "C",
-             "keep at most C tree objects in memory at durable points (0: no bound, the "
+             "keep at most C tree objects in memory at any time (0: no bound, the "
              "default; at most " +
                  walkBound + ")"},
             {"--journal-limit", "MIB",
