@@ -12,6 +12,8 @@
 
 #include "tests/AssertDeath.h"
 #include "tests/BTreeCheck.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapNodeRules.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapWalk.h"
 
 namespace tarn {
 namespace {
@@ -182,6 +184,7 @@ TEST_F(BTreeSearch, CheckerNoticesEveryKindOfDamage) {
     decltype(second->m_prev) none;
     decltype(map().m_lastLeaf) wrongLast;
     wrongLast = first;
+    auto twice = Root()->GetEntry(0).m_ptr;
     // Each damage undoes itself when applied again.
     const std::function<void()> damages[] = {
         [&] { std::swap(map().m_size, size); },
@@ -190,6 +193,7 @@ TEST_F(BTreeSearch, CheckerNoticesEveryKindOfDamage) {
         [&] { std::swap(first->GetEntry(49).first, second->GetEntry(0).first); },
         [&] { std::swap(first->m_numKeyEntrys, count); },
         [&] { std::swap(map().m_lastLeaf, wrongLast); },
+        [&] { std::swap(Root()->GetEntry(1).m_ptr, twice); },  // a child reached twice
     };
     ASSERT_EQ(CheckBTree(map()), "");
     for (const auto& damage : damages) {
@@ -198,6 +202,77 @@ TEST_F(BTreeSearch, CheckerNoticesEveryKindOfDamage) {
         damage();
         EXPECT_EQ(CheckBTree(map()), "");
     }
+}
+
+// What a node may hold at each place: the one rule every check of a stored
+// tree uses.
+TEST(BTreeNodeRules, EachPlaceHasItsClassAndEntryRange) {
+    using Rule = FieldIdToOffsetOpsOnInt64FieldMapNodeRule;
+    const ReflectedClass* leaf = &GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>();
+    const ReflectedClass* internal =
+        &GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>();
+    struct Case {
+        ssize_t level;
+        bool isRoot;
+        const ReflectedClass* nodeClass;
+        ssize_t least;
+    };
+    for (const Case& c :
+         {Case{0, true, leaf, 0}, Case{0, false, leaf, 50}, Case{1, true, internal, 1},
+          Case{1, false, internal, 50}, Case{3, true, internal, 1}, Case{3, false, internal, 50}}) {
+        const Rule rule = FieldIdToOffsetOpsOnInt64FieldMapRuleAt(c.level, c.isRoot);
+        EXPECT_EQ(rule.nodeClass, c.nodeClass) << c.level;
+        EXPECT_EQ(&FieldIdToOffsetOpsOnInt64FieldMapClassAt(c.level), c.nodeClass);
+        EXPECT_FALSE(rule.AllowsCount(c.least - 1)) << c.level << c.isRoot;
+        EXPECT_TRUE(rule.AllowsCount(c.least));
+        EXPECT_TRUE(rule.AllowsCount(100));
+        EXPECT_FALSE(rule.AllowsCount(101));
+        EXPECT_EQ(rule.CountProblem(101), "101 entries, not " + std::to_string(c.least) + "..100");
+        EXPECT_EQ(rule.CountProblem(c.least), "");
+    }
+    EXPECT_EQ(FieldIdToOffsetOpsOnInt64FieldMapRuleAlone(false).minEntries, 0);
+    EXPECT_EQ(FieldIdToOffsetOpsOnInt64FieldMapRuleAlone(true).minEntries, 1);
+    EXPECT_EQ(FieldIdToOffsetOpsOnInt64FieldMapRuleAlone(true).maxEntries, 100);
+}
+
+// The walk every whole-tree check and the summary use: each node once, the
+// leaves in key order, each within the separators its place hands down.
+TEST_F(BTreeSearch, WalkVisitsEachNodeOnceWithTheBoundsOfItsPlace) {
+    Fill(1, 6000);  // height 2
+    class Recorder final : public FieldIdToOffsetOpsOnInt64FieldMapVisitor {
+    public:
+        bool Internal(const Place& place, const InternalNode& node) override {
+            ++internals;
+            EXPECT_EQ(place.isRoot, place.level == height);
+            return node.m_numKeyEntrys > 0;
+        }
+        void Leaf(const Place& place, const LeafNode& leaf) override {
+            EXPECT_EQ(place.level, 0);
+            const FieldId& first = leaf.GetEntry(0).first;
+            const FieldId& last = leaf.GetEntry(leaf.m_numKeyEntrys - 1).first;
+            EXPECT_TRUE(place.lo == nullptr || !(first < *place.lo));
+            EXPECT_TRUE(place.hi == nullptr || last < *place.hi);
+            EXPECT_TRUE(keys.empty() || keys.back() < first);
+            for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
+                keys.push_back(leaf.GetEntry(i).first);
+            }
+        }
+        void Unloadable(const Place&, const std::string& error) override { ADD_FAILURE() << error; }
+        void ReachedTwice(const Place&) override { ADD_FAILURE() << "reached twice"; }
+        void BetweenNodes() override { ++between; }
+
+        ssize_t height = 0;
+        int internals = 0;
+        int between = 0;
+        std::vector<FieldId> keys;
+    } walk;
+    walk.height = map().m_height;
+    ASSERT_GE(walk.height, 2);
+    WalkFieldIdToOffsetOpsOnInt64FieldMap(map(), walk);
+    EXPECT_EQ(static_cast<ssize_t>(walk.keys.size()), map().size());
+    EXPECT_EQ(walk.internals + static_cast<int>(testing::LeafCounts(map()).size()), walk.between);
+    EXPECT_EQ(walk.internals + static_cast<ssize_t>(testing::LeafCounts(map()).size()),
+              map().GetNumNodes());
 }
 
 }  // namespace

@@ -42,7 +42,13 @@ void MemoryBound::MakeRoomForOperation() {
 void MemoryBound::KeepUnder() {
     if (On() && m_tree.Space().NumResidents() >= m_bound) {
         NotePeak();
-        m_tree.Space().EvictCleanResidents(m_bound / 2);
+        KeepUnder(m_tree.Space(), m_bound);
+    }
+}
+
+void MemoryBound::KeepUnder(CSpace& space, ssize_t bound) {
+    if (bound > 0 && space.NumResidents() >= bound) {
+        space.EvictCleanResidents(bound / 2);
     }
 }
 

@@ -36,6 +36,8 @@ public:
     // Between the nodes of a walk: releases clean residents down to half the
     // bound once the bound is reached.
     void KeepUnder();
+    // The same for another space (0: no bound).
+    static void KeepUnder(CSpace& space, ssize_t bound);
     // After a checkpoint or a whole-tree walk: clean residents down to half.
     void Trim();
     // Whether the tree has more nodes than the bound allows in memory.

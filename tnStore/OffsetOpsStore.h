@@ -187,7 +187,7 @@ struct StoreCheck {
 // reaches.
 struct StoreValidation {
     StoreCheck check;
-    bool mapValid = false;  // the map's own Validate, run only on a sound tree
+    bool mapValid = false;  // the map's own Validate, run only on a tree the check passed
     int64 images = 0;       // stored
     int64 reached = 0;      // of those, reached from a root
     std::vector<uint64> unreachable;

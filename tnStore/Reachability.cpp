@@ -5,7 +5,7 @@
 
 #include "tnPersistStore/IPrefVisitor.h"
 #include "tnPersistStore/pref.h"
-#include "tnStore/TreeWalk.h"
+#include "tnStore/MemoryBound.h"
 #include "tnUtils/RuntimeError.h"
 
 namespace tarn {
@@ -47,7 +47,7 @@ ReachabilityResult FindUnreachableImages(CSpace& space, ssize_t bound) {
         queue.pop_front();
         try {
             space.Resolve(OID(Seid(oid)), nullptr)->VisitPrefs(collector);
-            KeepResidentsUnder(space, bound);
+            MemoryBound::KeepUnder(space, bound);
         } catch (const RuntimeError& e) {
             result.errors.push_back(e.what());
         }

@@ -5,9 +5,11 @@
 // Starting from every named root, the walk follows the references each object
 // reports through its VisitPrefs slot (for the offsets record: record -> map
 // -> root -> children, down to the leaves), loading objects as it goes, and
-// compares what it reached with the identities the store holds. Loads
-// everything reachable and evicts nothing. Run it holding the space (either
-// lock).
+// compares what it reached with the identities the store holds. It loads
+// everything reachable, one object at a time, and keeps at most `bound` of
+// them in memory (releasing clean ones down to half the bound); it holds the
+// identities it has seen. Run it holding the space: exclusively when bounded,
+// either lock otherwise.
 
 #include <string>
 #include <vector>
@@ -23,8 +25,6 @@ struct ReachabilityResult {
     std::vector<std::string> errors;  // objects that could not be loaded
 };
 
-// Keeps at most `bound` objects resident (0: no bound); needs the space
-// exclusively when bounded.
 ReachabilityResult FindUnreachableImages(CSpace& space, ssize_t bound = 0);
 
 }  // namespace tarn

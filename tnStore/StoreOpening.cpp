@@ -101,7 +101,7 @@ void LoadSummary(OffsetOpsStoreImpl& handle) {
     if (LoadTreeSummary(tree.Space(), handle.Recording().Bounds())) {
         return;
     }
-    RebuildTreeSummary(tree, handle.Memory().Objects(), handle.Recording().Bounds());
+    RebuildTreeSummary(tree, handle.Memory(), handle.Recording().Bounds());
     if (!handle.IsReader()) {
         tree.CommitToBackend();
         handle.Opening().repairs.push_back(

@@ -4,6 +4,7 @@
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMap.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapNodeRules.h"
 #include "tnUtils/RuntimeError.h"
 
 namespace tarn {
@@ -14,8 +15,6 @@ using Map = FieldIdToOffsetOpsOnInt64FieldMap;
 using LeafNode = Map::LeafNode;
 using InternalNode = Map::InternalNode;
 
-constexpr ssize_t kMaxEntries = FieldIdToOffsetOpsOnInt64FieldMapMaxEntries;
-constexpr ssize_t kMinEntries = FieldIdToOffsetOpsOnInt64FieldMapMinEntries;
 // A tree of 2^64 entries at 50 a node is 11 levels high; anything above
 // this is damage.
 constexpr ssize_t kMaxHeight = 64;
@@ -80,12 +79,14 @@ ssize_t SlotFor(const InternalNode& node, const FieldId& key) {
 
 void CheckAlone(OID oid, const NodeView& node) {
     const ssize_t n = node.Count();
-    if (n < 0 || n > kMaxEntries) {
+    const FieldIdToOffsetOpsOnInt64FieldMapNodeRule rule =
+        FieldIdToOffsetOpsOnInt64FieldMapRuleAlone(node.Internal() != nullptr);
+    if (n < 0 || n > rule.maxEntries) {
         Damaged(oid, "holds " + std::to_string(n) + " entries, outside 0.." +
-                         std::to_string(kMaxEntries));
+                         std::to_string(rule.maxEntries));
     }
     if (const InternalNode* internal = node.Internal()) {
-        if (n < 1) {
+        if (!rule.AllowsCount(n)) {
             Damaged(oid, "is an internal node without entries");
         }
         for (ssize_t slot = 0; slot <= n; ++slot) {
@@ -118,7 +119,9 @@ void CheckHeader(OID oid, const Map& map) {
 }
 
 void CheckClassForLevel(OID oid, const NodeView& node, ssize_t level, const std::string& where) {
-    if (node.IsLeaf() != (level == 0)) {
+    const bool leafLevel =
+        &FieldIdToOffsetOpsOnInt64FieldMapClassAt(level) == &GetReflectedClass<LeafNode>();
+    if (node.IsLeaf() != leafLevel) {
         Damaged(oid,
                 std::string("is ") + (node.IsLeaf() ? "a leaf" : "an internal node") + " where " +
                     where + " needs " +
@@ -129,12 +132,13 @@ void CheckClassForLevel(OID oid, const NodeView& node, ssize_t level, const std:
 // Keys within the bounds slot `slot` of `parent` gives: at or above the
 // separator on its left, below the one on its right; and the entries a node
 // below the root holds.
-void CheckUnder(OID oid, const NodeView& node, const InternalNode& parent, OID parentOid,
-                ssize_t slot) {
+void CheckUnder(OID oid, const NodeView& node, ssize_t level, const InternalNode& parent,
+                OID parentOid, ssize_t slot) {
     const std::string where = "its parent " + ToString(parentOid);
-    if (node.Count() < kMinEntries) {
+    const ssize_t least = FieldIdToOffsetOpsOnInt64FieldMapRuleAt(level, false).minEntries;
+    if (node.Count() < least) {
         Damaged(oid, "holds " + std::to_string(node.Count()) + " entries below the root (" + where +
-                         "), fewer than " + std::to_string(kMinEntries));
+                         "), fewer than " + std::to_string(least));
     }
     if (slot > 0 && CompareKeys(node.Key(0), parent.GetEntry(slot - 1).m_key) < 0) {
         Damaged(oid, "has the key " + ToString(node.Key(0)) + " below the bound " +
@@ -188,7 +192,7 @@ void TreeLoadCheck::Loaded(const CSpace& space, OID oid, ptr<IPersistable> obj,
         const OID child = ChildAt(parent, slot).m_oid;
         if (child == oid) {
             CheckClassForLevel(oid, node, level - 1, "its parent " + ToString(at));
-            CheckUnder(oid, node, parent, at, slot);
+            CheckUnder(oid, node, level - 1, parent, at, slot);
             return;
         }
         // A parent holding the node in another slot than its first key
@@ -196,7 +200,7 @@ void TreeLoadCheck::Loaded(const CSpace& space, OID oid, ptr<IPersistable> obj,
         for (ssize_t other = 0; other <= parent.m_numKeyEntrys; ++other) {
             if (other != slot && ChildAt(parent, other).m_oid == oid) {
                 CheckClassForLevel(oid, node, level - 1, "its parent " + ToString(at));
-                CheckUnder(oid, node, parent, at, other);
+                CheckUnder(oid, node, level - 1, parent, at, other);
             }
         }
         at = child;

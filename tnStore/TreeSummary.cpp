@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "tnStore/TreeWalk.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapWalk.h"
 
 namespace tarn {
 
@@ -46,25 +46,61 @@ void SetTreeSummary(CSpace& space, const RefusalBounds& bounds) {
     }
 }
 
-void RebuildTreeSummary(TreeSpace& tree, ssize_t bound, RefusalBounds& bounds) {
+namespace {
+
+// Counts the nodes and notes every table's records in the bounds; a node
+// that cannot be loaded as its place needs ends the walk.
+class SummaryWalk final : public FieldIdToOffsetOpsOnInt64FieldMapVisitor {
+public:
+    SummaryWalk(MemoryBound& memory, RefusalBounds& bounds) : m_memory(memory), m_bounds(bounds) {}
+
+    bool Internal(const Place&, const InternalNode&) override {
+        ++internalNodes;
+        return true;
+    }
+    void Leaf(const Place&, const LeafNode& leaf) override {
+        ++leaves;
+        for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
+            for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
+                m_bounds.NoteStored(site, so);
+            }
+        }
+    }
+    void Unloadable(const Place& place, const std::string& error) override {
+        throw RuntimeError(
+            RuntimeError::Category::Damaged,
+            "damaged tree: " + (error.empty() ? "a missing reference to a node at level " +
+                                                    std::to_string(place.level)
+                                              : error));
+    }
+    void ReachedTwice(const Place& place) override {
+        throw RuntimeError(RuntimeError::Category::Damaged,
+                           "damaged tree: node " + ToString(place.ref.m_oid) + " is reached twice");
+    }
+    void BetweenNodes() override { m_memory.KeepUnder(); }
+
+    int64 leaves = 0;
+    int64 internalNodes = 0;
+
+private:
+    MemoryBound& m_memory;
+    RefusalBounds& m_bounds;
+};
+
+}  // namespace
+
+void RebuildTreeSummary(TreeSpace& tree, MemoryBound& memory, RefusalBounds& bounds) {
     bounds.Clear();
-    const TreeShape shape =
-        WalkTree(tree.Space(), tree.Record().m_map.m_oid, bound,
-                 [&](const FieldIdToOffsetOpsOnInt64FieldMapLeafNode& leaf) {
-                     for (ssize_t i = 0; i < leaf.m_numKeyEntrys; ++i) {
-                         for (const auto& [site, so] : leaf.GetEntry(i).second.m_map.getmap()) {
-                             bounds.NoteStored(site, so);
-                         }
-                     }
-                 });
+    SummaryWalk walk(memory, bounds);
+    WalkFieldIdToOffsetOpsOnInt64FieldMap(tree.Map(), walk);
     CSpace& space = tree.Space();
     const auto set = [&](const ReflectedClass& rc, int64 n) {
         space.SetCounter(CSpace::PopulationCounter(rc.m_name), static_cast<uint64>(n));
     };
     set(GetReflectedClass<OffsetOps>(), 1);
     set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMap>(), 1);
-    set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>(), shape.leaves);
-    set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>(), shape.internalNodes);
+    set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapLeafNode>(), walk.leaves);
+    set(GetReflectedClass<FieldIdToOffsetOpsOnInt64FieldMapInternalNode>(), walk.internalNodes);
     SetTreeSummary(space, bounds);
 }
 

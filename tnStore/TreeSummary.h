@@ -13,6 +13,7 @@
 //                          table any more, after Clear)
 
 #include "tnRuntime/CSpace.h"
+#include "tnStore/MemoryBound.h"
 #include "tnStore/RefusalBounds.h"
 #include "tnStore/TreeSpace.h"
 
@@ -22,9 +23,9 @@ namespace tarn {
 bool LoadTreeSummary(const CSpace& space, RefusalBounds& bounds);
 // Sets the summary's counters for the next commit. Exclusive.
 void SetTreeSummary(CSpace& space, const RefusalBounds& bounds);
-// For a store from before summaries: walks the stored tree (keeping at most
-// `bound` objects in memory, 0: no bound) for the bounds and the node counts, and sets the counters
+// For a store from before summaries: walks the stored tree (within the
+// memory bound) for the bounds and the node counts, and sets the counters
 // for the next commit. Exclusive.
-void RebuildTreeSummary(TreeSpace& tree, ssize_t bound, RefusalBounds& bounds);
+void RebuildTreeSummary(TreeSpace& tree, MemoryBound& memory, RefusalBounds& bounds);
 
 }  // namespace tarn

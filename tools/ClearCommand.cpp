@@ -11,7 +11,7 @@ int RunClear(const Arguments& args, Io& io) {
     OffsetOpsStore store = OpenAndReport(args.Store(), StoreMode::WriteExisting, io.err);
     // Clearing hands the whole tree to deletion, which walks it: refuse a
     // damaged tree first.
-    RequireSoundTree(store);
+    RequireTreeCheckPasses(store);
     const int64 fields = store.Size();
     const int64 imagesBefore = store.Stats().images;
     store.Clear();

@@ -48,7 +48,7 @@ OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostrea
     return OpenAndReport(dir, options, err);
 }
 
-void RequireSoundTree(OffsetOpsStore& store) {
+void RequireTreeCheckPasses(OffsetOpsStore& store) {
     const StoreCheck check = store.Check();
     if (!check.Ok()) {
         throw RuntimeError(

@@ -34,7 +34,7 @@ OffsetOpsStore OpenAndReport(const std::string& dir, StoreMode mode, std::ostrea
 // Refuses (RuntimeError) a tree that a walk over all of it could not take
 // safely; the store refuses to walk one too, this says so before anything
 // happens.
-void RequireSoundTree(OffsetOpsStore& store);
+void RequireTreeCheckPasses(OffsetOpsStore& store);
 
 // "--cache-nodes B is too small: a tree of height H needs at least N objects
 // in memory".

@@ -1,10 +1,11 @@
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapCheck.h"
 
 #include <optional>
-#include <unordered_set>
 #include <utility>
 
 #include "tnOperation/src/WorkingSet/CompOp/CompareKeys.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapNodeRules.h"
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapWalk.h"
 #include "tnUtils/RuntimeError.h"
 #include "tnUtils/xostream.h"
 
@@ -25,13 +26,7 @@ std::string Name(uint64 oid) {
     return "#" + std::to_string(oid);
 }
 
-// A reference that holds no pointer into the space: by identity, unless the
-// object has none yet (then it is not stored, and no eviction releases it).
-prefbase Detached(const prefbase& ref) {
-    return ref.m_oid.IsNull() ? ref : prefbase(ref.m_oid);
-}
-
-class Checker {
+class Checker final : public FieldIdToOffsetOpsOnInt64FieldMapVisitor {
 public:
     Checker(TreeCheckResult& result, const std::function<void()>& betweenNodes)
         : m_result(result), m_betweenNodes(betweenNodes) {}
@@ -40,15 +35,13 @@ public:
     // loaded: the hook between nodes may release the header too.
     void Run(const Map& map) {
         CheckHeader(map);
-        const ssize_t height = map.m_height;
         const ssize_t size = map.m_size;
-        const prefbase root = Detached(map.m_root);
         m_firstLeaf = map.m_firstLeaf.m_oid.value_;
         m_lastLeaf = map.m_lastLeaf.m_oid.value_;
-        if (height < 0 || !root) {
+        if (map.m_height < 0 || !map.m_root) {
             return;
         }
-        Node(height, root, true, nullptr, nullptr);
+        WalkFieldIdToOffsetOpsOnInt64FieldMap(map, *this);
         CheckChain();
         if (m_result.entries != size) {  // invariant 7
             Problem("the map's size is " + std::to_string(size) + " but its leaves hold " +
@@ -63,7 +56,7 @@ private:
         }
     }
 
-    void BetweenNodes() {
+    void BetweenNodes() override {
         if (m_betweenNodes) {
             m_betweenNodes();
         }
@@ -92,104 +85,63 @@ private:
         }
     }
 
-    // Loads the node of `ref` as the class `rc`; null (with a problem) when it
-    // cannot be loaded or has another class.
-    void* Load(const prefbase& ref, const ReflectedClass& rc, const char* what) {
-        if (!ref) {
-            Problem(std::string("a missing reference where a ") + what + " should be");
-            return nullptr;
-        }
-        try {
-            return ref.Resolve(&rc).m_self;
-        } catch (const RuntimeError& e) {
-            Problem(std::string(what) + " " + Name(ref) + ": " + e.what());
-            return nullptr;
+    // Invariant 3: a node that cannot be loaded as its level needs.
+    void Unloadable(const Place& place, const std::string& error) override {
+        const std::string what = place.level == 0 ? "leaf" : "internal node";
+        if (error.empty()) {
+            Problem("a missing reference where a " + what + " should be");
+        } else {
+            Problem(what + " " + Name(place.ref) + ": " + error);
         }
     }
 
-    // Invariants 3, 4 and 5 for the subtree of `ref` at `height`, whose keys
-    // must lie in [lo, hi) (null: unbounded). What the subtrees below need of
-    // the node is copied before they are checked.
-    void Node(ssize_t height, const prefbase& ref, bool isRoot, const FieldId* lo,
-              const FieldId* hi) {
-        if (ref && !m_seen.insert(ref.m_oid.value_).second) {
-            Problem("node " + Name(ref) + " is reached twice");
-            return;
-        }
-        if (height == 0) {
-            Leaf(ref, isRoot, lo, hi);
-            return;
-        }
-        std::vector<FieldId> keys;
-        std::vector<prefbase> children;
-        if (!Internal(ref, isRoot, lo, hi, keys, children)) {
-            return;
-        }
-        BetweenNodes();
-        const std::size_t n = keys.size();
-        Node(height - 1, children[0], false, lo, &keys[0]);
-        for (std::size_t i = 0; i < n; ++i) {
-            Node(height - 1, children[i + 1], false, &keys[i], i + 1 < n ? &keys[i + 1] : hi);
-        }
+    void ReachedTwice(const Place& place) override {
+        Problem("node " + Name(place.ref) + " is reached twice");
     }
 
-    // Checks one internal node and copies out its keys and its children
-    // (leftmost first); false when its subtrees cannot be checked.
-    bool Internal(const prefbase& ref, bool isRoot, const FieldId* lo, const FieldId* hi,
-                  std::vector<FieldId>& keys, std::vector<prefbase>& children) {
-        auto* node = static_cast<InternalNode*>(
-            Load(ref, GetReflectedClass<InternalNode>(), "internal node"));
-        if (node == nullptr) {
-            return false;
-        }
+    // Invariants 4 and 5 for one internal node; false when its subtrees
+    // cannot be checked.
+    bool Internal(const Place& place, const InternalNode& node) override {
         ++m_result.internalNodes;
-        const ssize_t n = node->m_numKeyEntrys;
-        const std::string name = "internal node " + Name(ref);
-        if (!CheckFill(name, n, isRoot ? 1 : 50) || n == 0) {
+        const ssize_t n = node.m_numKeyEntrys;
+        const std::string name = "internal node " + Name(place.ref);
+        if (!CheckFill(name, n, place) || n == 0) {
             return false;
         }
-        keys.reserve(static_cast<std::size_t>(n));
-        children.reserve(static_cast<std::size_t>(n) + 1);
-        children.push_back(Detached(node->m_ptr));
         for (ssize_t i = 0; i < n; ++i) {
-            CheckKey(name, i, node->GetEntry(i).m_key, i > 0 ? &node->GetEntry(i - 1).m_key : lo,
-                     hi);
-            keys.push_back(node->GetEntry(i).m_key);
-            children.push_back(Detached(node->GetEntry(i).m_ptr));
+            CheckKey(name, i, node.GetEntry(i).m_key,
+                     i > 0 ? &node.GetEntry(i - 1).m_key : place.lo, place.hi);
         }
         return true;
     }
 
-    void Leaf(const prefbase& ref, bool isRoot, const FieldId* lo, const FieldId* hi) {
-        auto* leaf = static_cast<LeafNode*>(Load(ref, GetReflectedClass<LeafNode>(), "leaf"));
-        if (leaf == nullptr) {
-            return;
-        }
+    void Leaf(const Place& place, const LeafNode& leaf) override {
         ++m_result.leaves;
-        const ssize_t n = leaf->m_numKeyEntrys;
-        const std::string name = "leaf " + Name(ref);
-        if (!CheckFill(name, n, isRoot ? 0 : 50)) {
+        const ssize_t n = leaf.m_numKeyEntrys;
+        const std::string name = "leaf " + Name(place.ref);
+        if (!CheckFill(name, n, place)) {
             return;
         }
         m_result.entries += n;
         for (ssize_t i = 0; i < n; ++i) {
-            CheckKey(name, i, leaf->GetEntry(i).first, i > 0 ? &leaf->GetEntry(i - 1).first : lo,
-                     hi);
+            CheckKey(name, i, leaf.GetEntry(i).first,
+                     i > 0 ? &leaf.GetEntry(i - 1).first : place.lo, place.hi);
         }
-        LeafAt at{ref.m_oid.value_, leaf->m_prev.m_oid.value_, leaf->m_next.m_oid.value_,
+        LeafAt at{place.ref.m_oid.value_, leaf.m_prev.m_oid.value_, leaf.m_next.m_oid.value_,
                   std::nullopt};
         if (n > 0) {
-            at.keys.emplace(leaf->GetEntry(0).first, leaf->GetEntry(n - 1).first);
+            at.keys.emplace(leaf.GetEntry(0).first, leaf.GetEntry(n - 1).first);
         }
         m_leaves.push_back(std::move(at));
-        BetweenNodes();
     }
 
-    bool CheckFill(const std::string& name, ssize_t n, ssize_t least) {
-        if (n < least || n > 100) {
-            Problem(name + " holds " + std::to_string(n) + " entries, not " +
-                    std::to_string(least) + "..100");
-            return n >= 0 && n <= 100;
+    // Whether the node's entries can be read: within the most any node holds.
+    bool CheckFill(const std::string& name, ssize_t n, const Place& place) {
+        const FieldIdToOffsetOpsOnInt64FieldMapNodeRule rule =
+            FieldIdToOffsetOpsOnInt64FieldMapRuleAt(place.level, place.isRoot);
+        if (!rule.AllowsCount(n)) {
+            Problem(name + " holds " + rule.CountProblem(n));
+            return n >= 0 && n <= rule.maxEntries;
         }
         return true;
     }
@@ -257,7 +209,6 @@ private:
     const std::function<void()>& m_betweenNodes;
     uint64 m_firstLeaf = 0;  // the header's links
     uint64 m_lastLeaf = 0;
-    std::unordered_set<uint64> m_seen;
     std::vector<LeafAt> m_leaves;  // in tree order
 };
 

@@ -1,5 +1,6 @@
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOpsImageCheck.h"
 
+#include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapNodeRules.h"
 #include "tnOperation/src/WorkingSet/CompOp/FieldIdToOffsetOpsOnInt64FieldMapNodes.h"
 #include "tnOperation/src/WorkingSet/CompOp/OffsetOps.h"
 #include "tnUtils/VariableLengthSerialise.h"
@@ -70,9 +71,11 @@ public:
 
     uint32 EntryCount() {
         uint32 n = Varint("entry count");
-        if (m_problem.empty() && n > FieldIdToOffsetOpsOnInt64FieldMapMaxEntries) {
-            Fail("entry count " + std::to_string(n) + " exceeds " +
-                 std::to_string(FieldIdToOffsetOpsOnInt64FieldMapMaxEntries));
+        // The most a node may hold wherever it sits; its place is not known
+        // here, and the load check tests the rest.
+        const ssize_t most = FieldIdToOffsetOpsOnInt64FieldMapRuleAlone(false).maxEntries;
+        if (m_problem.empty() && static_cast<ssize_t>(n) > most) {
+            Fail("entry count " + std::to_string(n) + " exceeds " + std::to_string(most));
         }
         return m_problem.empty() ? n : 0;
     }
