@@ -71,7 +71,7 @@ struct CommittedMap {
 
     // Average bytes of a leaf image in the store, framing included.
     double BytesPerImage() {
-        const StoreStats stats = subject.Space().GetStore().Stats();
+        const ImageCounts stats = subject.Space().GetStore().Stats();
         return stats.numImages == 0 ? 0.0
                                     : static_cast<double>(stats.numImageBytes) / stats.numImages;
     }

@@ -56,7 +56,7 @@ public:
             fn(oid);
         }
     }
-    StoreStats Stats() override { return {}; }
+    ImageCounts Stats() override { return {}; }
 
     std::map<uint64, std::vector<octet_t>> m_records;
 };

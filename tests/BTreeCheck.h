@@ -177,7 +177,7 @@ public:
     void ForEachIdentity(const std::function<void(uint64)>& fn) override {
         m_store.ForEachIdentity(fn);
     }
-    StoreStats Stats() override { return m_store.Stats(); }
+    ImageCounts Stats() override { return m_store.Stats(); }
 
     std::vector<uint64> m_lastWrites;
     std::vector<uint64> m_lastDeletes;

@@ -30,7 +30,7 @@ public:
         m_inner->ForEachIdentity(fn);
     }
     std::optional<uint64> LargestIdentity() override { return m_inner->LargestIdentity(); }
-    StoreStats Stats() override { return m_inner->Stats(); }
+    ImageCounts Stats() override { return m_inner->Stats(); }
 
 protected:
     IStore& Inner() { return *m_inner; }

@@ -49,7 +49,8 @@ struct CommitBatch {
     uint64 nextIdentity = 1;                 // the identity counter
 };
 
-struct StoreStats {
+// How many images a store holds and their bytes.
+struct ImageCounts {
     ssize_t numImages = 0;
     ssize_t numImageBytes = 0;  // bytes of all images as stored, framing included
 };
@@ -78,7 +79,7 @@ public:
         ForEachIdentity([&](uint64 oid) { largest = oid; });
         return largest;
     }
-    virtual StoreStats Stats() = 0;
+    virtual ImageCounts Stats() = 0;
 };
 
 }  // namespace tarn

@@ -209,14 +209,14 @@ std::optional<uint64> LmdbStore::LargestIdentity() {
     return IdentityOfKey(key);
 }
 
-StoreStats LmdbStore::Stats() {
+ImageCounts LmdbStore::Stats() {
     std::lock_guard lock(m_mutex);
     ThrowIfPoisoned();
     ReadScope read(*this);
     MDB_stat stat;
     CheckGuarded("counting the images",
                  [&]() noexcept { return mdb_stat(read.Txn(), m_images, &stat); });
-    StoreStats stats;
+    ImageCounts stats;
     stats.numImages = static_cast<ssize_t>(stat.ms_entries);
     // A format-1 store read as it is kept no count of the bytes: they are
     // counted here, from the leaves of the images' tree.

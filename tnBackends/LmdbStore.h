@@ -17,7 +17,7 @@
 //               8       4     format version, 2
 //               12      8     identity counter (the next identity to hand out)
 //               20      8     image bytes: the sum of the sizes of all image
-//                             records, as StoreStats::numImageBytes reports
+//                             records, as ImageCounts::numImageBytes reports
 //               28      4     number of roots R
 //               32            R roots in increasing byte order of their
 //                             names, each: name length n (2), name (n bytes),
@@ -176,7 +176,7 @@ public:
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;
     std::optional<uint64> LargestIdentity() override;
-    StoreStats Stats() override;
+    ImageCounts Stats() override;
 
     // The named counter as the latest commit holds it, also for a ReadOnly
     // store (whose other reads see its snapshot): a ReadOnly store reads and

@@ -107,9 +107,9 @@ void MemoryStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
     }
 }
 
-StoreStats MemoryStore::Stats() {
+ImageCounts MemoryStore::Stats() {
     std::shared_lock<std::shared_mutex> lock(m_mutex);
-    StoreStats stats;
+    ImageCounts stats;
     stats.numImages = static_cast<ssize_t>(m_images.size());
     for (const auto& [oid, image] : m_images) {
         stats.numImageBytes += static_cast<ssize_t>(image.className.size() + image.bytes.size());

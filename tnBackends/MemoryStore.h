@@ -22,7 +22,7 @@ public:
     uint64 NextIdentity() override;
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;
-    StoreStats Stats() override;
+    ImageCounts Stats() override;
 
     // Number of Commit calls that succeeded.
     ssize_t NumCommits();

@@ -266,7 +266,7 @@ void OverlayStore::ForEachIdentity(const std::function<void(uint64)>& fn) {
     }
 }
 
-StoreStats OverlayStore::Stats() {
+ImageCounts OverlayStore::Stats() {
     return m_base->Stats();
 }
 

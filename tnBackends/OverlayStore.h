@@ -51,7 +51,7 @@ public:
     uint64 NextIdentity() override;
     void Commit(const CommitBatch& batch) override;
     void ForEachIdentity(const std::function<void(uint64)>& fn) override;
-    StoreStats Stats() override;
+    ImageCounts Stats() override;
 
     // The bytes of the temporary file.
     uint64 FileBytes();

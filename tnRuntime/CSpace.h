@@ -86,8 +86,9 @@ namespace tarn {
 
 class prefbase;
 
-// Counts kept by a space, for tests, tools and benchmarks.
-struct CSpaceStats {
+// What a space counts of its own work (loads, commits, evictions), for
+// tests, tools and benchmarks.
+struct CSpaceCounts {
     int64 numRegistered = 0;  // objects registered (DollarNew)
     int64 numLoaded = 0;      // images loaded from the store
     int64 numMarkCalls = 0;   // MarkPersistentAsDirtyWithoutTrace calls reaching the space
@@ -151,7 +152,7 @@ public:
     // store receives them in identity order; this keeps the order of an
     // operation's marks observable.) Exclusive.
     std::vector<OID> DirtyInQueueOrder() const;
-    const CSpaceStats& Stats() const { return m_stats; }
+    const CSpaceCounts& Stats() const { return m_stats; }
     // The identity the next registered object receives.
     uint64 NextIdentity() const { return m_nextIdentity; }
 
@@ -282,7 +283,7 @@ private:
     std::map<std::string, uint64, std::less<>> m_pendingCounters;  // since the last commit
 
     ssize_t m_residentBound = 0;
-    CSpaceStats m_stats;
+    CSpaceCounts m_stats;
     LoadCheck* m_loadCheck = nullptr;
     // Registrations minus deletions per class since the last commit.
     std::map<std::string, int64, std::less<>> m_populationDelta;

@@ -192,7 +192,7 @@ StoreStatistics OffsetOpsStore::Stats() {
         stats.fields = tree.Map().size();
         stats.height = tree.Map().m_height;
         std::tie(stats.leaves, stats.internalNodes) = tree.NodeCounts();
-        const StoreStats stored = tree.Store().Stats();
+        const ImageCounts stored = tree.Store().Stats();
         stats.images = stored.numImages;
         stats.imageBytes = stored.numImageBytes;
         stats.journalBytes = static_cast<int64>(checkpoints.JournalBytes());
