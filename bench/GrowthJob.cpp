@@ -172,105 +172,108 @@ const char* kUsage =
     "--warm-heap B: before timing, each child grows its heap by B bytes per key,\n"
     "touches it and frees it (peak RSS then includes it).\n";
 
-int Main(int argc, char** argv) {
+struct Config {
     std::vector<uint64> sizes = {100000, 1000000};
-    std::vector<bool> orders = {false, true};
+    std::vector<bool> orders = {false, true};  // random?
     std::vector<std::string> subjects = {"tarn"};
-#ifdef TARN_BENCH_HAVE_ABSL
-    subjects.push_back("absl");
-#endif
     int repeat = 1;
     uint64 warmBytesPerKey = 0;
+};
+
+// One option and its value; false for one GrowthJob does not take.
+bool ParseOption(Config& config, const std::string& arg, const std::string& value) {
+    if (arg == "--sizes") {
+        config.sizes.clear();
+        for (const std::string& s : SplitList(value)) {
+            const std::optional<uint64> v = ParseCount(s);
+            if (!v || *v < 10) {
+                Usage(kUsage);
+            }
+            config.sizes.push_back(*v);
+        }
+    } else if (arg == "--order") {
+        config.orders.clear();
+        for (const std::string& s : SplitList(value)) {
+            if (s != "ascending" && s != "random") {
+                Usage(kUsage);
+            }
+            config.orders.push_back(s == "random");
+        }
+    } else if (arg == "--subjects") {
+        config.subjects = SplitList(value);
+    } else if (arg == "--warm-heap") {
+        const std::optional<uint64> v = ParseCount(value);
+        if (!v || *v > 4096) {
+            Usage(kUsage);
+        }
+        config.warmBytesPerKey = *v;
+    } else if (arg == "--repeat") {
+        const std::optional<uint64> v = ParseCount(value);
+        if (!v || *v == 0 || *v > 99) {
+            Usage(kUsage);
+        }
+        config.repeat = static_cast<int>(*v);
+    } else {
+        return false;
+    }
+    return true;
+}
+
+Config ParseArgs(int argc, char** argv) {
+    Config config;
+#ifdef TARN_BENCH_HAVE_ABSL
+    config.subjects.push_back("absl");
+#endif
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
-        if (i + 1 >= argc) {
-            Usage(kUsage);
-        }
-        const std::string value = argv[++i];
-        if (arg == "--sizes") {
-            sizes.clear();
-            for (const std::string& s : SplitList(value)) {
-                const std::optional<uint64> v = ParseCount(s);
-                if (!v || *v < 10) {
-                    Usage(kUsage);
-                }
-                sizes.push_back(*v);
-            }
-        } else if (arg == "--order") {
-            orders.clear();
-            for (const std::string& s : SplitList(value)) {
-                if (s != "ascending" && s != "random") {
-                    Usage(kUsage);
-                }
-                orders.push_back(s == "random");
-            }
-        } else if (arg == "--subjects") {
-            subjects = SplitList(value);
-        } else if (arg == "--warm-heap") {
-            const std::optional<uint64> v = ParseCount(value);
-            if (!v || *v > 4096) {
-                Usage(kUsage);
-            }
-            warmBytesPerKey = *v;
-        } else if (arg == "--repeat") {
-            const std::optional<uint64> v = ParseCount(value);
-            if (!v || *v == 0 || *v > 99) {
-                Usage(kUsage);
-            }
-            repeat = static_cast<int>(*v);
-        } else {
+        if (i + 1 >= argc || !ParseOption(config, arg, argv[++i])) {
             Usage(kUsage);
         }
     }
-    if (sizes.empty() || orders.empty() || subjects.empty()) {
+    if (config.sizes.empty() || config.orders.empty() || config.subjects.empty()) {
         Usage(kUsage);
     }
+    return config;
+}
+
+void PrintHeader(const Config& config) {
     std::printf(
         "GrowthJob: new fields inserted one Record each, one site, no commit until the end\n");
     std::printf("machine at start: %s\n", MachineLine().c_str());
-    std::printf("repeats %d (each figure is the best of the repeats)\n", repeat);
-    if (warmBytesPerKey > 0) {
+    std::printf("repeats %d (each figure is the best of the repeats)\n", config.repeat);
+    if (config.warmBytesPerKey > 0) {
         std::printf("heap warmed with %" PRIu64
                     " bytes per key before timing (peak RSS includes it)\n",
-                    warmBytesPerKey);
+                    config.warmBytesPerKey);
     }
     std::printf("\n");
     std::fflush(stdout);
+}
 
-    std::vector<Row> rows;
-    for (uint64 n : sizes) {
-        for (bool random : orders) {
-            for (const std::string& subject : subjects) {
-                rows.push_back(Row{subject, n, random, {}, ""});
-            }
-        }
+void RunRow(const Config& config, Row& row) {
+    const uint64 warm = config.warmBytesPerKey;
+    ChildOutcome<GrowthResult> outcome = RunInChild<GrowthResult>(
+        [&row, warm] { return RunCase(row.subject, row.n, row.random, warm); });
+    if (!outcome.result) {
+        row.error = outcome.error;
+        std::fprintf(stderr, "%s %" PRIu64 " %s: FAILED: %s\n", row.subject.c_str(), row.n,
+                     row.random ? "random" : "ascending", outcome.error.c_str());
+        return;
     }
-    for (int rep = 0; rep < repeat; ++rep) {
-        for (Row& row : rows) {
-            ChildOutcome<GrowthResult> outcome = RunInChild<GrowthResult>([&row, warmBytesPerKey] {
-                return RunCase(row.subject, row.n, row.random, warmBytesPerKey);
-            });
-            if (!outcome.result) {
-                row.error = outcome.error;
-                std::fprintf(stderr, "%s %" PRIu64 " %s: FAILED: %s\n", row.subject.c_str(), row.n,
-                             row.random ? "random" : "ascending", outcome.error.c_str());
-                continue;
-            }
-            const GrowthResult& r = *outcome.result;
-            if (r.size != static_cast<int64>(row.n)) {
-                row.error = "wrong size " + std::to_string(r.size);
-                std::fprintf(stderr, "%s: %s\n", row.subject.c_str(), row.error.c_str());
-                continue;
-            }
-            row.runs.push_back(r);
-            std::fprintf(stderr, "%-7s %9" PRIu64 " %-9s first %7.1f ns  last %7.1f ns  %.2fs\n",
-                         row.subject.c_str(), row.n, row.random ? "random" : "ascending",
-                         r.tenth[0] * 1e9 / static_cast<double>(row.n / 10),
-                         r.tenth[9] * 1e9 / static_cast<double>(row.n / 10), r.total);
-        }
+    const GrowthResult& r = *outcome.result;
+    if (r.size != static_cast<int64>(row.n)) {
+        row.error = "wrong size " + std::to_string(r.size);
+        std::fprintf(stderr, "%s: %s\n", row.subject.c_str(), row.error.c_str());
+        return;
     }
-    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    row.runs.push_back(r);
+    std::fprintf(stderr, "%-7s %9" PRIu64 " %-9s first %7.1f ns  last %7.1f ns  %.2fs\n",
+                 row.subject.c_str(), row.n, row.random ? "random" : "ascending",
+                 r.tenth[0] * 1e9 / static_cast<double>(row.n / 10),
+                 r.tenth[9] * 1e9 / static_cast<double>(row.n / 10), r.total);
+}
 
+void PrintTable(const std::vector<Row>& rows) {
     std::printf(
         "| subject | keys | order | first tenth ns/insert | last tenth ns/insert | "
         "last / first | inserts/s (all) | sync | close | RSS after inserts | peak RSS |\n");
@@ -291,23 +294,23 @@ int Main(int argc, char** argv) {
             r.close * 1e3, static_cast<double>(r.rssKiB) / 1024.0,
             static_cast<double>(r.peakRssKiB) / 1024.0);
     }
+}
 
+void PrintRatiosAndTargets(const Config& config, const std::vector<Row>& rows) {
     std::printf("\nRatios, tarn / absl (rate: higher is better for tarn)\n\n");
     std::printf("| keys | order | rate (all) | rate, first tenth | rate, last tenth |\n");
     std::printf("| ---: | --- | ---: | ---: | ---: |\n");
-    for (uint64 n : sizes) {
-        for (bool random : orders) {
+    for (uint64 n : config.sizes) {
+        for (bool random : config.orders) {
             const Row* t = FindRow(rows, "tarn", n, random);
             const Row* a = FindRow(rows, "absl", n, random);
-            if (t == nullptr || a == nullptr) {
-                continue;
+            if (t != nullptr && a != nullptr) {
+                std::printf("| %" PRIu64 " | %s | %.2fx | %.2fx | %.2fx |\n", n,
+                            random ? "random" : "ascending", t->Rate() / a->Rate(),
+                            a->NsFirst() / t->NsFirst(), a->NsLast() / t->NsLast());
             }
-            std::printf("| %" PRIu64 " | %s | %.2fx | %.2fx | %.2fx |\n", n,
-                        random ? "random" : "ascending", t->Rate() / a->Rate(),
-                        a->NsFirst() / t->NsFirst(), a->NsLast() / t->NsLast());
         }
     }
-
     std::printf("\nTargets:\n");
     if (const Row* t = FindRow(rows, "tarn", 1000000, false)) {
         const double ratio = t->NsLast() / t->NsFirst();
@@ -321,6 +324,27 @@ int Main(int argc, char** argv) {
         std::printf("  10^6 random, at least 1.5x absl::btree_map's rate: %.2fx -> %s\n", ratio,
                     ratio >= 1.5 ? "met" : "MISSED");
     }
+}
+
+int Main(int argc, char** argv) {
+    const Config config = ParseArgs(argc, argv);
+    PrintHeader(config);
+    std::vector<Row> rows;
+    for (uint64 n : config.sizes) {
+        for (bool random : config.orders) {
+            for (const std::string& subject : config.subjects) {
+                rows.push_back(Row{subject, n, random, {}, ""});
+            }
+        }
+    }
+    for (int rep = 0; rep < config.repeat; ++rep) {
+        for (Row& row : rows) {
+            RunRow(config, row);
+        }
+    }
+    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    PrintTable(rows);
+    PrintRatiosAndTargets(config, rows);
     return 0;
 }
 

@@ -22,6 +22,7 @@
 //                       copyable result (or the error that ended it) back
 //                       through a pipe
 //   OpStream            the generated stream of offset operations
+//   Thousands(), MiB()  figures as the tables show them
 //   MakeSites(n)        the n site identities of a stream
 //   SplitList, ParseCount, NextCountArgument, Usage
 //                       reading the programs' arguments
@@ -177,6 +178,31 @@ inline std::string DefaultStoreRoot(const char* leaf) {
     std::filesystem::path root =
         ec ? std::filesystem::current_path() / leaf : exe.parent_path() / leaf;
     return root.string();
+}
+
+// ---- Figures in the tables ---------------------------------------------------
+
+// "1,234,567": a whole number with thousands separated.
+inline std::string Thousands(double v) {
+    char buf[64];
+    std::snprintf(buf, sizeof buf, "%.0f", v);
+    std::string digits = buf;
+    std::string out;
+    const std::size_t start = digits[0] == '-' ? 1 : 0;
+    for (std::size_t i = 0; i < digits.size(); ++i) {
+        if (i > start && (digits.size() - i) % 3 == 0) {
+            out += ',';
+        }
+        out += digits[i];
+    }
+    return out;
+}
+
+// "12.3 MiB".
+inline std::string MiB(double bytes) {
+    char buf[32];
+    std::snprintf(buf, sizeof buf, "%.1f MiB", bytes / (1024.0 * 1024.0));
+    return buf;
 }
 
 // ---- Child processes ---------------------------------------------------------

@@ -535,27 +535,6 @@ struct Row {
     }
 };
 
-std::string Thousands(double v) {
-    char buf[64];
-    std::snprintf(buf, sizeof buf, "%.0f", v);
-    std::string digits = buf;
-    std::string out;
-    const std::size_t start = digits[0] == '-' ? 1 : 0;
-    for (std::size_t i = 0; i < digits.size(); ++i) {
-        if (i > start && (digits.size() - i) % 3 == 0) {
-            out += ',';
-        }
-        out += digits[i];
-    }
-    return out;
-}
-
-std::string MiB(int64 bytes) {
-    char buf[32];
-    std::snprintf(buf, sizeof buf, "%.1f MiB", static_cast<double>(bytes) / (1024.0 * 1024.0));
-    return buf;
-}
-
 const char* kUsage =
     "usage: MainJob [--ops N] [--fields F] [--sites S] [--seed X]\n"
     "               [--subjects tarn,sqlite,rocksdb] [--every 1000,10000,100000]\n"
@@ -565,75 +544,101 @@ const char* kUsage =
     "--cache-share K bounds it to the unbounded run's nodes / K (tarn must run).\n"
     "Counts take k/M suffixes (1M, 10k).\n";
 
-Config ParseArgs(int argc, char** argv) {
-    Config config;
 #ifdef TARN_BENCH_HAVE_SQLITE
-    const bool haveSqlite = true;
+constexpr bool kHaveSqlite = true;
 #else
-    const bool haveSqlite = false;
+constexpr bool kHaveSqlite = false;
 #endif
 #ifdef TARN_BENCH_HAVE_ROCKSDB
-    const bool haveRocksdb = true;
+constexpr bool kHaveRocksdb = true;
 #else
-    const bool haveRocksdb = false;
+constexpr bool kHaveRocksdb = false;
 #endif
+
+// The subjects of --subjects; exits for one this build cannot run.
+std::vector<std::string> SubjectsOf(const char* list) {
+    std::vector<std::string> subjects = SplitList(list);
+    for (const std::string& s : subjects) {
+        if (s != "tarn" && !(s == "sqlite" && kHaveSqlite) && !(s == "rocksdb" && kHaveRocksdb)) {
+            std::fprintf(stderr, "MainJob: unknown or unavailable subject %s\n", s.c_str());
+            std::exit(2);
+        }
+    }
+    return subjects;
+}
+
+std::vector<uint64> EveryOf(const char* list) {
+    std::vector<uint64> every;
+    for (const std::string& s : SplitList(list)) {
+        const std::optional<uint64> v = ParseCount(s);
+        if (!v || *v == 0) {
+            Usage(kUsage);
+        }
+        every.push_back(*v);
+    }
+    return every;
+}
+
+std::vector<bool> SyncedOf(const char* list) {
+    std::vector<bool> synced;
+    for (const std::string& s : SplitList(list)) {
+        if (s != "on" && s != "off") {
+            Usage(kUsage);
+        }
+        synced.push_back(s == "on");
+    }
+    return synced;
+}
+
+// The option at argv[i] (and its value, stepping i onto it); false for one
+// that is not an option of MainJob.
+bool ParseOption(Config& config, int argc, char** argv, int& i) {
+    auto count = [&] { return NextCountArgument(argc, argv, i, kUsage); };
+    const std::string arg = argv[i];
+    const bool valued = i + 1 < argc;
+    if (arg == "--ops") {
+        config.ops = count();
+    } else if (arg == "--fields") {
+        config.fields = count();
+    } else if (arg == "--sites") {
+        config.sites = static_cast<uint32>(std::min<uint64>(count(), 1000));
+    } else if (arg == "--seed") {
+        config.seed = count();
+    } else if (arg == "--repeat") {
+        config.repeat = static_cast<int>(std::min<uint64>(count(), 99));
+    } else if (arg == "--cache-nodes") {
+        config.cacheNodes = static_cast<int64>(count());
+    } else if (arg == "--cache-share") {
+        config.cacheShare = static_cast<int64>(count());
+    } else if (arg == "--sqlite-cache-mib") {
+        config.sqliteCacheMiB = static_cast<int64>(count());
+    } else if (arg == "--subjects" && valued) {
+        config.subjects = SubjectsOf(argv[++i]);
+    } else if (arg == "--every" && valued) {
+        config.every = EveryOf(argv[++i]);
+    } else if (arg == "--sync" && valued) {
+        config.synced = SyncedOf(argv[++i]);
+    } else if (arg == "--dir" && valued) {
+        config.dir = argv[++i];
+    } else if (arg == "--no-baseline") {
+        config.baseline = false;
+    } else {
+        return false;
+    }
+    return true;
+}
+
+Config ParseArgs(int argc, char** argv) {
+    Config config;
     config.subjects.push_back("tarn");
-    if (haveSqlite) {
+    if (kHaveSqlite) {
         config.subjects.push_back("sqlite");
     }
-    if (haveRocksdb) {
+    if (kHaveRocksdb) {
         config.subjects.push_back("rocksdb");
     }
-    auto count = [&](int& i) { return NextCountArgument(argc, argv, i, kUsage); };
     for (int i = 1; i < argc; ++i) {
-        const std::string arg = argv[i];
-        if (arg == "--ops") {
-            config.ops = count(i);
-        } else if (arg == "--fields") {
-            config.fields = count(i);
-        } else if (arg == "--sites") {
-            config.sites = static_cast<uint32>(std::min<uint64>(count(i), 1000));
-        } else if (arg == "--seed") {
-            config.seed = count(i);
-        } else if (arg == "--repeat") {
-            config.repeat = static_cast<int>(std::min<uint64>(count(i), 99));
-        } else if (arg == "--cache-nodes") {
-            config.cacheNodes = static_cast<int64>(count(i));
-        } else if (arg == "--cache-share") {
-            config.cacheShare = static_cast<int64>(count(i));
-        } else if (arg == "--sqlite-cache-mib") {
-            config.sqliteCacheMiB = static_cast<int64>(count(i));
-        } else if (arg == "--subjects" && i + 1 < argc) {
-            config.subjects = SplitList(argv[++i]);
-            for (const std::string& s : config.subjects) {
-                if (s != "tarn" && !(s == "sqlite" && haveSqlite) &&
-                    !(s == "rocksdb" && haveRocksdb)) {
-                    std::fprintf(stderr, "MainJob: unknown or unavailable subject %s\n", s.c_str());
-                    std::exit(2);
-                }
-            }
-        } else if (arg == "--every" && i + 1 < argc) {
-            config.every.clear();
-            for (const std::string& s : SplitList(argv[++i])) {
-                const std::optional<uint64> v = ParseCount(s);
-                if (!v || *v == 0) {
-                    Usage(kUsage);
-                }
-                config.every.push_back(*v);
-            }
-        } else if (arg == "--sync" && i + 1 < argc) {
-            config.synced.clear();
-            for (const std::string& s : SplitList(argv[++i])) {
-                if (s != "on" && s != "off") {
-                    Usage(kUsage);
-                }
-                config.synced.push_back(s == "on");
-            }
-        } else if (arg == "--dir" && i + 1 < argc) {
-            config.dir = argv[++i];
-        } else if (arg == "--no-baseline") {
-            config.baseline = false;
-        } else {
+        if (!ParseOption(config, argc, argv, i)) {
             Usage(kUsage);
         }
     }
@@ -683,9 +688,7 @@ double Rate(const Config& config, const Row& row) {
     return static_cast<double>(config.ops) / row.Median().seconds;
 }
 
-int Main(int argc, char** argv) {
-    const Config config = ParseArgs(argc, argv);
-    std::filesystem::create_directories(config.dir);
+void PrintHeader(const Config& config, const Contents& expected) {
     const std::string fsKind = FileSystemKind(config.dir);
     std::printf("MainJob: %s operations over %s fields from %u sites, seed %" PRIu64 "\n",
                 Thousands(static_cast<double>(config.ops)).c_str(),
@@ -695,12 +698,12 @@ int Main(int argc, char** argv) {
     std::printf("machine at start: %s\n", MachineLine().c_str());
     std::printf("repeats %d (the run with the median time is shown)\n\n", config.repeat);
     std::fflush(stdout);
-
-    const Contents expected = Expected(config);
     std::printf("every store must end with %s (field, site) records whose sums add up to %" PRId64
                 "\n\n",
                 Thousands(static_cast<double>(expected.records)).c_str(), expected.sum);
+}
 
+std::vector<Row> MakeRows(const Config& config) {
     std::vector<Row> rows;
     if (config.baseline) {
         rows.push_back(Row{Case{"generator", config.ops, false}, {}, ""});
@@ -712,52 +715,57 @@ int Main(int argc, char** argv) {
             }
         }
     }
-    for (int rep = 0; rep < config.repeat; ++rep) {
-        for (Row& row : rows) {
-            const std::string dir = config.dir + "/" + row.c.subject;
-            if (row.c.subject == "tarn-bounded") {
-                row.c.cacheObjects = BoundFor(config, rows, row.c);
-            }
-            ::sync();  // earlier cases' dirty pages go to disk outside this case
-            ChildOutcome<CaseResult> outcome = RunInChild<CaseResult>(
-                [&config, &row, &dir] { return RunCase(config, row.c, dir); });
-            RemoveDir(dir);
-            if (!outcome.result) {
-                row.error = outcome.error;
-                std::fprintf(stderr, "%s every %" PRIu64 " %s: FAILED: %s\n", row.c.subject.c_str(),
-                             row.c.every, row.c.synced ? "synced" : "unsynced",
-                             outcome.error.c_str());
-                continue;
-            }
-            const CaseResult& r = *outcome.result;
-            if (row.c.subject != "generator" &&
-                (r.contents.records != expected.records || r.contents.sum != expected.sum)) {
-                row.error = "wrong contents: " + std::to_string(r.contents.records) +
-                            " records, sum " + std::to_string(r.contents.sum) + "; expected " +
-                            std::to_string(expected.records) + ", " + std::to_string(expected.sum);
-                std::fprintf(stderr, "%s: %s\n", row.c.subject.c_str(), row.error.c_str());
-                continue;
-            }
-            row.runs.push_back(r);
-            if (row.c.subject == "generator") {
-                std::fprintf(stderr, "generator only %10.0f ops/s  rss %s\n",
-                             static_cast<double>(config.ops) / r.seconds,
-                             MiB(r.peakRssKiB * 1024).c_str());
-                continue;
-            }
-            std::fprintf(
-                stderr,
-                "%-9s every %-6" PRIu64
-                " %-8s %10.0f ops/s %8.1f B/op  %s  rss %s  close %.2f s  cpu %.2f s  %s\n",
-                row.c.subject.c_str(), row.c.every, row.c.synced ? "synced" : "unsynced",
-                static_cast<double>(config.ops) / r.seconds,
-                static_cast<double>(r.writeBytes) / static_cast<double>(config.ops),
-                MiB(r.storeBytes).c_str(), MiB(r.peakRssKiB * 1024).c_str(), r.closeSeconds,
-                r.cpuSeconds, r.notes);
-        }
-    }
-    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    return rows;
+}
 
+// The line a finished run prints on standard error.
+void PrintProgress(const Config& config, const Row& row, const CaseResult& r) {
+    if (row.c.subject == "generator") {
+        std::fprintf(stderr, "generator only %10.0f ops/s  rss %s\n",
+                     static_cast<double>(config.ops) / r.seconds, MiB(r.peakRssKiB * 1024).c_str());
+        return;
+    }
+    std::fprintf(stderr,
+                 "%-9s every %-6" PRIu64
+                 " %-8s %10.0f ops/s %8.1f B/op  %s  rss %s  close %.2f s  cpu %.2f s  %s\n",
+                 row.c.subject.c_str(), row.c.every, row.c.synced ? "synced" : "unsynced",
+                 static_cast<double>(config.ops) / r.seconds,
+                 static_cast<double>(r.writeBytes) / static_cast<double>(config.ops),
+                 MiB(r.storeBytes).c_str(), MiB(r.peakRssKiB * 1024).c_str(), r.closeSeconds,
+                 r.cpuSeconds, r.notes);
+}
+
+// One run of a row's case in a child of its own; a failed run or wrong
+// contents leave the row's error.
+void RunRow(const Config& config, const Contents& expected, std::vector<Row>& rows, Row& row) {
+    const std::string dir = config.dir + "/" + row.c.subject;
+    if (row.c.subject == "tarn-bounded") {
+        row.c.cacheObjects = BoundFor(config, rows, row.c);
+    }
+    ::sync();  // earlier cases' dirty pages go to disk outside this case
+    ChildOutcome<CaseResult> outcome =
+        RunInChild<CaseResult>([&config, &row, &dir] { return RunCase(config, row.c, dir); });
+    RemoveDir(dir);
+    if (!outcome.result) {
+        row.error = outcome.error;
+        std::fprintf(stderr, "%s every %" PRIu64 " %s: FAILED: %s\n", row.c.subject.c_str(),
+                     row.c.every, row.c.synced ? "synced" : "unsynced", outcome.error.c_str());
+        return;
+    }
+    const CaseResult& r = *outcome.result;
+    if (row.c.subject != "generator" &&
+        (r.contents.records != expected.records || r.contents.sum != expected.sum)) {
+        row.error = "wrong contents: " + std::to_string(r.contents.records) + " records, sum " +
+                    std::to_string(r.contents.sum) + "; expected " +
+                    std::to_string(expected.records) + ", " + std::to_string(expected.sum);
+        std::fprintf(stderr, "%s: %s\n", row.c.subject.c_str(), row.error.c_str());
+        return;
+    }
+    row.runs.push_back(r);
+    PrintProgress(config, row, r);
+}
+
+void PrintTable(const Config& config, const std::vector<Row>& rows) {
     std::printf(
         "| subject | durable every | synced | ops/s | written/op | store after close | "
         "peak RSS | seconds | of which close | CPU seconds |\n");
@@ -784,7 +792,20 @@ int Main(int argc, char** argv) {
                     MiB(r.storeBytes).c_str(), MiB(r.peakRssKiB * 1024).c_str(), r.seconds,
                     r.closeSeconds, r.cpuSeconds);
     }
+}
 
+void PrintRatioRow(const std::string& subject, const std::string& peer, uint64 every, bool synced,
+                   const CaseResult& a, const CaseResult& b) {
+    auto ratio = [](double x, double y) { return y == 0 ? 0.0 : x / y; };
+    std::printf("| %s | %s | %s | %s | %.3gx | %.3gx | %.3gx | %.3gx |\n", subject.c_str(),
+                peer.c_str(), Thousands(static_cast<double>(every)).c_str(), synced ? "yes" : "no",
+                ratio(b.seconds, a.seconds),
+                ratio(static_cast<double>(a.writeBytes), static_cast<double>(b.writeBytes)),
+                ratio(static_cast<double>(a.storeBytes), static_cast<double>(b.storeBytes)),
+                ratio(static_cast<double>(a.peakRssKiB), static_cast<double>(b.peakRssKiB)));
+}
+
+void PrintRatios(const Config& config, const std::vector<Row>& rows) {
     std::printf(
         "\nRatios, tarn / peer (ops/s: higher is better for tarn; written/op, store, "
         "RSS: lower is better for tarn)\n\n");
@@ -801,20 +822,9 @@ int Main(int argc, char** argv) {
                 for (bool synced : config.synced) {
                     const Row* t = FindRow(rows, subject, every, synced);
                     const Row* p = FindRow(rows, peer, every, synced);
-                    if (t == nullptr || p == nullptr) {
-                        continue;
+                    if (t != nullptr && p != nullptr) {
+                        PrintRatioRow(subject, peer, every, synced, t->Median(), p->Median());
                     }
-                    const CaseResult& a = t->Median();
-                    const CaseResult& b = p->Median();
-                    auto ratio = [](double x, double y) { return y == 0 ? 0.0 : x / y; };
-                    std::printf(
-                        "| %s | %s | %s | %s | %.3gx | %.3gx | %.3gx | %.3gx |\n", subject.c_str(),
-                        peer.c_str(), Thousands(static_cast<double>(every)).c_str(),
-                        synced ? "yes" : "no", ratio(b.seconds, a.seconds),
-                        ratio(static_cast<double>(a.writeBytes), static_cast<double>(b.writeBytes)),
-                        ratio(static_cast<double>(a.storeBytes), static_cast<double>(b.storeBytes)),
-                        ratio(static_cast<double>(a.peakRssKiB),
-                              static_cast<double>(b.peakRssKiB)));
                 }
             }
         }
@@ -826,7 +836,9 @@ int Main(int argc, char** argv) {
                         row.c.synced ? "synced" : "unsynced", row.c.cacheObjects);
         }
     }
+}
 
+void PrintTargets(const Config& config, const std::vector<Row>& rows) {
     const Row* t = FindRow(rows, "tarn", 10000, true);
     const Row* s = FindRow(rows, "sqlite", 10000, true);
     if (t != nullptr && (config.ops != 1000000 || config.fields != 100000 || config.sites != 4)) {
@@ -845,6 +857,23 @@ int Main(int argc, char** argv) {
         std::printf("  at most 200 bytes written per operation: %.0f -> %s\n", perOp,
                     perOp <= 200.0 ? "met" : "MISSED");
     }
+}
+
+int Main(int argc, char** argv) {
+    const Config config = ParseArgs(argc, argv);
+    std::filesystem::create_directories(config.dir);
+    const Contents expected = Expected(config);
+    PrintHeader(config, expected);
+    std::vector<Row> rows = MakeRows(config);
+    for (int rep = 0; rep < config.repeat; ++rep) {
+        for (Row& row : rows) {
+            RunRow(config, expected, rows, row);
+        }
+    }
+    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    PrintTable(config, rows);
+    PrintRatios(config, rows);
+    PrintTargets(config, rows);
     return 0;
 }
 

@@ -451,18 +451,6 @@ Summary Summarise(const std::vector<Row>& rows, Op op, uint64 n) {
     return s;
 }
 
-std::string Thousands(uint64 v) {
-    std::string digits = std::to_string(v);
-    std::string out;
-    for (std::size_t i = 0; i < digits.size(); ++i) {
-        if (i > 0 && (digits.size() - i) % 3 == 0) {
-            out += ',';
-        }
-        out += digits[i];
-    }
-    return out;
-}
-
 std::string Millis(double seconds) {
     char buf[32];
     const double ms = seconds * 1000.0;
@@ -473,12 +461,6 @@ std::string Millis(double seconds) {
 std::string Seconds(double seconds) {
     char buf[32];
     std::snprintf(buf, sizeof buf, "%.1f s", seconds);
-    return buf;
-}
-
-std::string MiB(double bytes) {
-    char buf[32];
-    std::snprintf(buf, sizeof buf, "%.1f MiB", bytes / (1024.0 * 1024.0));
     return buf;
 }
 
@@ -614,15 +596,14 @@ std::string Today() {
 // pages a writer's checkpoint leaves.
 constexpr uint64 kBytesPerFieldBound = 1024;
 
-int Main(int argc, char** argv) {
-    const Config config = ParseArgs(argc, argv);
-    std::filesystem::create_directories(config.dir);
-    const std::string fsKind = FileSystemKind(config.dir);
 #ifdef TARN_BENCH_HAVE_SQLITE
-    const bool haveSqlite = true;
+constexpr bool kHaveSqlite = true;
 #else
-    const bool haveSqlite = false;
+constexpr bool kHaveSqlite = false;
 #endif
+
+void PrintHeader(const Config& config) {
+    const std::string fsKind = FileSystemKind(config.dir);
     std::printf("OpenJob: opening stores of");
     for (uint64 n : config.sizes) {
         std::printf(" %s", Thousands(n).c_str());
@@ -634,115 +615,120 @@ int Main(int argc, char** argv) {
                 MiB(static_cast<double>(FreeBytes(config.dir))).c_str());
     std::printf("machine at start: %s\n", MachineLine().c_str());
     std::printf("repeats %d (medians of time and of peak RSS); SQLite %s; offsetops %s\n",
-                config.repeat, haveSqlite ? "in" : "left out (not built)",
+                config.repeat, kHaveSqlite ? "in" : "left out (not built)",
                 config.tool.empty() ? "left out" : config.tool.c_str());
     std::fflush(stdout);
+}
 
+std::vector<Op> OpsOf(const Config& config) {
     std::vector<Op> ops = {Op::Nothing, Op::Find, Op::Stats, Op::Record};
-    if (haveSqlite) {
+    if (kHaveSqlite) {
         ops.push_back(Op::Sqlite);
     }
     if (!config.tool.empty()) {
         ops.push_back(Op::ToolShow);
         ops.push_back(Op::ToolStats);
     }
+    return ops;
+}
 
-    std::vector<Size> sizes;
-    std::vector<Row> rows;
-    for (uint64 n : config.sizes) {
-        Size size;
-        size.n = n;
-        const std::string tarnDir = config.dir + "/tarn-" + std::to_string(n);
-        const std::string sqliteDir = config.dir + "/sqlite-" + std::to_string(n);
-        const uint64 free = FreeBytes(config.dir);
-        if (free < n * kBytesPerFieldBound) {
-            size.error = "skipped: " + MiB(static_cast<double>(free)) + " free, " +
-                         MiB(static_cast<double>(n * kBytesPerFieldBound)) + " wanted";
-            std::fprintf(stderr, "%s fields: %s\n", Thousands(n).c_str(), size.error.c_str());
-            sizes.push_back(size);
-            continue;
-        }
-        ChildOutcome<BuildResult> built = RunInChild<BuildResult>(
-            [n, &config, &tarnDir] { return BuildTarn(n, config.buildCacheObjects, tarnDir); });
-        if (!built.result) {
-            size.error = "building: " + built.error;
-            std::fprintf(stderr, "%s fields: %s\n", Thousands(n).c_str(), size.error.c_str());
-            RemoveDir(tarnDir);
-            sizes.push_back(size);
-            continue;
-        }
-        size.tarn = *built.result;
+// Builds the store and the SQLite database of `n` fields; false (with the
+// size's error) when there is no room or the store cannot be built.
+bool BuildSize(const Config& config, Size& size, const std::string& tarnDir,
+               const std::string& sqliteDir) {
+    const uint64 n = size.n;
+    const uint64 free = FreeBytes(config.dir);
+    if (free < n * kBytesPerFieldBound) {
+        size.error = "skipped: " + MiB(static_cast<double>(free)) + " free, " +
+                     MiB(static_cast<double>(n * kBytesPerFieldBound)) + " wanted";
+        std::fprintf(stderr, "%s fields: %s\n", Thousands(n).c_str(), size.error.c_str());
+        return false;
+    }
+    ChildOutcome<BuildResult> built = RunInChild<BuildResult>(
+        [n, &config, &tarnDir] { return BuildTarn(n, config.buildCacheObjects, tarnDir); });
+    if (!built.result) {
+        size.error = "building: " + built.error;
+        std::fprintf(stderr, "%s fields: %s\n", Thousands(n).c_str(), size.error.c_str());
+        RemoveDir(tarnDir);
+        return false;
+    }
+    size.tarn = *built.result;
 #ifdef TARN_BENCH_HAVE_SQLITE
-        ChildOutcome<BuildResult> builtSqlite =
-            RunInChild<BuildResult>([n, &sqliteDir] { return BuildSqlite(n, sqliteDir); });
-        if (builtSqlite.result) {
-            size.sqlite = *builtSqlite.result;
-            size.haveSqlite = true;
-        } else {
-            std::fprintf(stderr, "%s fields: building the SQLite database: %s\n",
-                         Thousands(n).c_str(), builtSqlite.error.c_str());
-        }
+    ChildOutcome<BuildResult> builtSqlite =
+        RunInChild<BuildResult>([n, &sqliteDir] { return BuildSqlite(n, sqliteDir); });
+    if (builtSqlite.result) {
+        size.sqlite = *builtSqlite.result;
+        size.haveSqlite = true;
+    } else {
+        std::fprintf(stderr, "%s fields: building the SQLite database: %s\n", Thousands(n).c_str(),
+                     builtSqlite.error.c_str());
+    }
+#else
+    (void)sqliteDir;
 #endif
-        ::sync();
-        std::fprintf(stderr,
-                     "%s fields: built the store in %.1f s (%s, peak RSS %s), the SQLite "
-                     "database in %.1f s (%s)\n",
-                     Thousands(n).c_str(), size.tarn.seconds,
-                     MiB(static_cast<double>(size.tarn.bytes)).c_str(),
-                     MiB(static_cast<double>(size.tarn.peakRssKiB) * 1024).c_str(),
-                     size.sqlite.seconds, MiB(static_cast<double>(size.sqlite.bytes)).c_str());
-        const std::size_t firstRow = rows.size();
-        for (Op op : ops) {
-            if (op == Op::Sqlite && !size.haveSqlite) {
-                continue;
-            }
+    ::sync();
+    std::fprintf(stderr,
+                 "%s fields: built the store in %.1f s (%s, peak RSS %s), the SQLite "
+                 "database in %.1f s (%s)\n",
+                 Thousands(n).c_str(), size.tarn.seconds,
+                 MiB(static_cast<double>(size.tarn.bytes)).c_str(),
+                 MiB(static_cast<double>(size.tarn.peakRssKiB) * 1024).c_str(), size.sqlite.seconds,
+                 MiB(static_cast<double>(size.sqlite.bytes)).c_str());
+    return true;
+}
+
+// One run of a row: the program in a process, or a library case in a child.
+CaseResult RunOnce(const Config& config, const Row& row, uint64 n, int rep,
+                   const std::string& tarnDir, const std::string& sqliteDir) {
+    if (row.op == Op::ToolShow) {
+        const std::string field = FieldText(KeyOf(Middle(n)));
+        return RunTool(config.tool, {"show", "--store", tarnDir, "--field", field});
+    }
+    if (row.op == Op::ToolStats) {
+        return RunTool(config.tool, {"stats", "--store", tarnDir});
+    }
+    const Op op = row.op;
+    ChildOutcome<CaseResult> outcome = RunInChild<CaseResult>([op, n, rep, &tarnDir, &sqliteDir] {
+        return RunLibraryCase(op, n, rep, tarnDir, sqliteDir);
+    });
+    if (!outcome.result) {
+        throw std::runtime_error(outcome.error);
+    }
+    return *outcome.result;
+}
+
+// The rows of one size, each run `repeat` times.
+void RunSize(const Config& config, const Size& size, const std::vector<Op>& ops,
+             std::vector<Row>& rows, const std::string& tarnDir, const std::string& sqliteDir) {
+    const uint64 n = size.n;
+    const std::size_t firstRow = rows.size();
+    for (Op op : ops) {
+        if (op != Op::Sqlite || size.haveSqlite) {
             rows.push_back(Row{op, n, {}, ""});
         }
-        const std::string field = FieldText(KeyOf(Middle(n)));
-        for (int rep = 0; rep < config.repeat; ++rep) {
-            for (std::size_t i = firstRow; i < rows.size(); ++i) {
-                Row& row = rows[i];
-                if (!row.error.empty()) {
-                    continue;
-                }
-                try {
-                    if (row.op == Op::ToolShow) {
-                        row.runs.push_back(
-                            RunTool(config.tool, {"show", "--store", tarnDir, "--field", field}));
-                    } else if (row.op == Op::ToolStats) {
-                        row.runs.push_back(RunTool(config.tool, {"stats", "--store", tarnDir}));
-                    } else {
-                        const Op op = row.op;
-                        ChildOutcome<CaseResult> outcome =
-                            RunInChild<CaseResult>([op, n, rep, &tarnDir, &sqliteDir] {
-                                return RunLibraryCase(op, n, rep, tarnDir, sqliteDir);
-                            });
-                        if (!outcome.result) {
-                            throw std::runtime_error(outcome.error);
-                        }
-                        row.runs.push_back(*outcome.result);
-                    }
-                    const CaseResult& r = row.runs.back();
-                    std::fprintf(stderr, "%s fields, %-16s %10s  rss %s\n", Thousands(n).c_str(),
-                                 OpName(row.op), Millis(r.seconds).c_str(),
-                                 MiB(static_cast<double>(r.peakRssKiB) * 1024).c_str());
-                } catch (const std::exception& e) {
-                    row.error = e.what();
-                    std::fprintf(stderr, "%s fields, %s: FAILED: %s\n", Thousands(n).c_str(),
-                                 OpName(row.op), row.error.c_str());
-                }
+    }
+    for (int rep = 0; rep < config.repeat; ++rep) {
+        for (std::size_t i = firstRow; i < rows.size(); ++i) {
+            Row& row = rows[i];
+            if (!row.error.empty()) {
+                continue;
+            }
+            try {
+                row.runs.push_back(RunOnce(config, row, n, rep, tarnDir, sqliteDir));
+                const CaseResult& r = row.runs.back();
+                std::fprintf(stderr, "%s fields, %-16s %10s  rss %s\n", Thousands(n).c_str(),
+                             OpName(row.op), Millis(r.seconds).c_str(),
+                             MiB(static_cast<double>(r.peakRssKiB) * 1024).c_str());
+            } catch (const std::exception& e) {
+                row.error = e.what();
+                std::fprintf(stderr, "%s fields, %s: FAILED: %s\n", Thousands(n).c_str(),
+                             OpName(row.op), row.error.c_str());
             }
         }
-        if (config.keep) {
-            std::fprintf(stderr, "kept %s and %s\n", tarnDir.c_str(), sqliteDir.c_str());
-        } else {
-            RemoveDir(tarnDir);
-            RemoveDir(sqliteDir);
-        }
-        sizes.push_back(size);
     }
-    std::printf("machine at end: %s\n", MachineLine().c_str());
+}
 
+void PrintStores(const std::vector<Size>& sizes) {
     std::printf("\n### The stores\n\n");
     std::printf(
         "| fields | store | built in | build peak RSS | SQLite database | built in | "
@@ -764,11 +750,15 @@ int Main(int argc, char** argv) {
                                           .c_str()
                                     : "-");
     }
+}
 
+void PrintResults(const Config& config, const std::vector<Row>& rows,
+                  const std::vector<Size>& sizes) {
+    PrintStores(sizes);
     PrintTable(rows, sizes, Op::Find, "Reader: open, Find one field, close", true);
     PrintTable(rows, sizes, Op::Stats, "Reader: open, Stats(), close", true);
     PrintTable(rows, sizes, Op::Record, "Writer: open, Record one operation, close", true);
-    if (haveSqlite) {
+    if (kHaveSqlite) {
         PrintTable(rows, sizes, Op::Sqlite, "SQLite: open, SELECT one field's rows, close", true);
     }
     if (!config.tool.empty()) {
@@ -783,6 +773,33 @@ int Main(int argc, char** argv) {
         }
     }
     std::printf(".\n");
+}
+
+int Main(int argc, char** argv) {
+    const Config config = ParseArgs(argc, argv);
+    std::filesystem::create_directories(config.dir);
+    PrintHeader(config);
+    const std::vector<Op> ops = OpsOf(config);
+    std::vector<Size> sizes;
+    std::vector<Row> rows;
+    for (uint64 n : config.sizes) {
+        Size size;
+        size.n = n;
+        const std::string tarnDir = config.dir + "/tarn-" + std::to_string(n);
+        const std::string sqliteDir = config.dir + "/sqlite-" + std::to_string(n);
+        if (BuildSize(config, size, tarnDir, sqliteDir)) {
+            RunSize(config, size, ops, rows, tarnDir, sqliteDir);
+            if (config.keep) {
+                std::fprintf(stderr, "kept %s and %s\n", tarnDir.c_str(), sqliteDir.c_str());
+            } else {
+                RemoveDir(tarnDir);
+                RemoveDir(sqliteDir);
+            }
+        }
+        sizes.push_back(size);
+    }
+    std::printf("machine at end: %s\n", MachineLine().c_str());
+    PrintResults(config, rows, sizes);
     return 0;
 }
 

@@ -136,114 +136,105 @@ const char* kUsage =
     "--only record leaves the killed store in DIR/store; --only reopen then opens it\n"
     "in this process (no fork), so that a profiler sees only the replay.\n";
 
-int Main(int argc, char** argv) {
+// One option and its value.
+void ParseOption(Config& config, const std::string& arg, const std::string& value) {
+    if (arg == "--dir") {
+        config.dir = value;
+        return;
+    }
+    if (arg == "--only") {
+        if (value != "record" && value != "reopen") {
+            Usage(kUsage);
+        }
+        config.only = value;
+        return;
+    }
+    const std::optional<uint64> v = ParseCount(value);
+    if (!v || *v == 0) {
+        Usage(kUsage);
+    }
+    if (arg == "--ops") {
+        config.ops = *v;
+    } else if (arg == "--fields") {
+        config.fields = *v;
+    } else if (arg == "--sites") {
+        config.sites = static_cast<uint32>(std::min<uint64>(*v, 1000));
+    } else if (arg == "--every") {
+        config.every = *v;
+    } else if (arg == "--seed") {
+        config.seed = *v;
+    } else if (arg == "--repeat") {
+        config.repeat = static_cast<int>(std::min<uint64>(*v, 99));
+    } else {
+        Usage(kUsage);
+    }
+}
+
+Config ParseArgs(int argc, char** argv) {
     Config config;
     for (int i = 1; i < argc; ++i) {
         const std::string arg = argv[i];
         if (i + 1 >= argc) {
             Usage(kUsage);
         }
-        const std::string value = argv[++i];
-        if (arg == "--dir") {
-            config.dir = value;
-            continue;
-        }
-        if (arg == "--only") {
-            if (value != "record" && value != "reopen") {
-                Usage(kUsage);
-            }
-            config.only = value;
-            continue;
-        }
-        const std::optional<uint64> v = ParseCount(value);
-        if (!v || *v == 0) {
-            Usage(kUsage);
-        }
-        if (arg == "--ops") {
-            config.ops = *v;
-        } else if (arg == "--fields") {
-            config.fields = *v;
-        } else if (arg == "--sites") {
-            config.sites = static_cast<uint32>(std::min<uint64>(*v, 1000));
-        } else if (arg == "--every") {
-            config.every = *v;
-        } else if (arg == "--seed") {
-            config.seed = *v;
-        } else if (arg == "--repeat") {
-            config.repeat = static_cast<int>(std::min<uint64>(*v, 99));
-        } else {
-            Usage(kUsage);
-        }
+        ParseOption(config, arg, argv[++i]);
     }
     if (config.dir.empty()) {
         config.dir = DefaultStoreRoot("recoveryjob-stores");
     }
-    std::filesystem::create_directories(config.dir);
-    const std::string dir = config.dir + "/store";
-    if (config.only == "reopen") {
-        const RecoveryResult r = Reopen(dir);
-        std::printf("open %.3f s, replayed %" PRId64 " (%.2f M ops/s), close %.3f s\n",
-                    r.openSeconds, r.replayed,
-                    static_cast<double>(r.replayed) / r.openSeconds / 1e6, r.closeSeconds);
+    return config;
+}
+
+struct Row {
+    const char* name;
+    bool cold;
+    std::vector<RecoveryResult> runs;
+};
+
+// Records in a child that is killed, then reopens the store in another
+// child (after dropping it from the page cache for a cold row). Returns the
+// status to end with: -1 to go on.
+int RunRow(const Config& config, const std::string& dir, Row& row) {
+    RemoveDir(dir);
+    ::sync();
+    std::fflush(nullptr);
+    const pid_t pid = ::fork();
+    if (pid < 0) {
+        std::fprintf(stderr, "RecoveryJob: fork failed\n");
+        return 1;
+    }
+    if (pid == 0) {
+        RecordAndDie(config, dir);
+    }
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    if (!WIFSIGNALED(status) || WTERMSIG(status) != SIGKILL) {
+        std::fprintf(stderr, "RecoveryJob: the recording child did not die as planned\n");
+        return 1;
+    }
+    if (config.only == "record") {
+        std::printf("killed store left in %s\n", dir.c_str());
         return 0;
     }
-    std::printf("RecoveryJob: %" PRIu64 " operations over %" PRIu64
-                " fields from %u sites, durable every %" PRIu64 ", then SIGKILL\n",
-                config.ops, config.fields, config.sites, config.every);
-    std::printf("stores under %s (%s)\n", config.dir.c_str(), FileSystemKind(config.dir).c_str());
-    std::printf("machine at start: %s\n\n", MachineLine().c_str());
-    std::fflush(stdout);
-
-    struct Row {
-        const char* name;
-        bool cold;
-        std::vector<RecoveryResult> runs;
-    };
-    std::vector<Row> rows = {{"warm", false, {}}, {"cold", true, {}}};
-    for (int rep = 0; rep < config.repeat; ++rep) {
-        for (Row& row : rows) {
-            RemoveDir(dir);
-            ::sync();
-            std::fflush(nullptr);
-            const pid_t pid = ::fork();
-            if (pid < 0) {
-                std::fprintf(stderr, "RecoveryJob: fork failed\n");
-                return 1;
-            }
-            if (pid == 0) {
-                RecordAndDie(config, dir);
-            }
-            int status = 0;
-            ::waitpid(pid, &status, 0);
-            if (!WIFSIGNALED(status) || WTERMSIG(status) != SIGKILL) {
-                std::fprintf(stderr, "RecoveryJob: the recording child did not die as planned\n");
-                return 1;
-            }
-            if (config.only == "record") {
-                std::printf("killed store left in %s\n", dir.c_str());
-                return 0;
-            }
-            if (row.cold) {
-                DropFromCache(dir);
-            }
-            ChildOutcome<RecoveryResult> outcome =
-                RunInChild<RecoveryResult>([&dir] { return Reopen(dir); });
-            if (!outcome.result) {
-                std::fprintf(stderr, "RecoveryJob: reopening: %s\n", outcome.error.c_str());
-                return 1;
-            }
-            const RecoveryResult& r = *outcome.result;
-            row.runs.push_back(r);
-            std::fprintf(stderr,
-                         "%s: open %.3f s (cpu %.3f s), replayed %" PRId64
-                         " (%.2f M ops/s), close %.3f s\n",
-                         row.name, r.openSeconds, r.openCpuSeconds, r.replayed,
-                         static_cast<double>(r.replayed) / r.openSeconds / 1e6, r.closeSeconds);
-        }
+    if (row.cold) {
+        DropFromCache(dir);
     }
-    RemoveDir(dir);
-    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    ChildOutcome<RecoveryResult> outcome =
+        RunInChild<RecoveryResult>([&dir] { return Reopen(dir); });
+    if (!outcome.result) {
+        std::fprintf(stderr, "RecoveryJob: reopening: %s\n", outcome.error.c_str());
+        return 1;
+    }
+    const RecoveryResult& r = *outcome.result;
+    row.runs.push_back(r);
+    std::fprintf(
+        stderr, "%s: open %.3f s (cpu %.3f s), replayed %" PRId64 " (%.2f M ops/s), close %.3f s\n",
+        row.name, r.openSeconds, r.openCpuSeconds, r.replayed,
+        static_cast<double>(r.replayed) / r.openSeconds / 1e6, r.closeSeconds);
+    return -1;
+}
 
+void PrintTable(const Config& config, std::vector<Row>& rows) {
     std::printf(
         "| page cache | journal | replayed ops | fields | open (median) | open CPU | "
         "replayed ops/s, median | best | close (checkpoint) | peak RSS |\n");
@@ -277,6 +268,36 @@ int Main(int argc, char** argv) {
         "\nTarget: at least 1,000,000 operations/s replayed (warm, median of %d): "
         "%.2f M -> %s (best %.2f M)\n",
         config.repeat, warmMedian / 1e6, warmMedian >= 1e6 ? "met" : "MISSED", warmBest / 1e6);
+}
+
+int Main(int argc, char** argv) {
+    const Config config = ParseArgs(argc, argv);
+    std::filesystem::create_directories(config.dir);
+    const std::string dir = config.dir + "/store";
+    if (config.only == "reopen") {
+        const RecoveryResult r = Reopen(dir);
+        std::printf("open %.3f s, replayed %" PRId64 " (%.2f M ops/s), close %.3f s\n",
+                    r.openSeconds, r.replayed,
+                    static_cast<double>(r.replayed) / r.openSeconds / 1e6, r.closeSeconds);
+        return 0;
+    }
+    std::printf("RecoveryJob: %" PRIu64 " operations over %" PRIu64
+                " fields from %u sites, durable every %" PRIu64 ", then SIGKILL\n",
+                config.ops, config.fields, config.sites, config.every);
+    std::printf("stores under %s (%s)\n", config.dir.c_str(), FileSystemKind(config.dir).c_str());
+    std::printf("machine at start: %s\n\n", MachineLine().c_str());
+    std::fflush(stdout);
+    std::vector<Row> rows = {{"warm", false, {}}, {"cold", true, {}}};
+    for (int rep = 0; rep < config.repeat; ++rep) {
+        for (Row& row : rows) {
+            if (const int status = RunRow(config, dir, row); status >= 0) {
+                return status;
+            }
+        }
+    }
+    RemoveDir(dir);
+    std::printf("machine at end: %s\n\n", MachineLine().c_str());
+    PrintTable(config, rows);
     return 0;
 }
 
