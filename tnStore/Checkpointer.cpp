@@ -15,12 +15,17 @@ void Checkpointer::Start(uint64 durable, uint64 checkpointed, std::unique_ptr<Jo
     m_durable = durable;
     m_checkpointed = checkpointed;
     m_journal = std::move(journal);
+    if (m_journal != nullptr) {
+        m_journalBytes = m_journal->FileBytes();
+    }
 }
 
 void Checkpointer::StartNewJournal(uint64 base) {
     Journal::Reset(m_dir, base, m_sync);
     m_journal = std::make_unique<Journal>(
         m_dir, JournalScan{base, base, Journal::kHeaderBytes, Journal::kHeaderBytes}, m_sync);
+    CSpaceGuard guard(m_tree.Space(), LockMode::Exclusive);
+    m_journalBytes = m_journal->FileBytes();
 }
 
 void Checkpointer::AddRecord(const Opid& opid, const FieldId& field, int64 offset) {
@@ -39,10 +44,14 @@ void Checkpointer::AddClear() {
 
 void Checkpointer::Sync() {
     if (m_journal != nullptr) {
-        m_journal->Commit();
+        m_journal->Commit();  // the append and the sync, readers not held up
     }
+    CSpaceGuard guard(m_tree.Space(), LockMode::Exclusive);
     m_durable += static_cast<uint64>(m_pending);
     m_pending = 0;
+    if (m_journal != nullptr) {
+        m_journalBytes = m_journal->FileBytes();
+    }
 }
 
 bool Checkpointer::JournalPast(std::size_t limit) const {
@@ -75,7 +84,7 @@ bool Checkpointer::HasWorkSinceCheckpoint() const {
 }
 
 uint64 Checkpointer::JournalBytes() const {
-    return m_journal != nullptr ? m_journal->FileBytes() : m_replayedJournalBytes;
+    return m_journalBytes;
 }
 
 }  // namespace tarn

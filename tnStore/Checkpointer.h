@@ -22,7 +22,11 @@
 //
 // Owns the journal (writers of store directories only; readers and
 // in-memory stores have none), the positions and this handle's checkpoint
-// count. Threads: a handle's.
+// count. Threads: the calls that change something are the writer's (under
+// the handle's writer lock); they change the positions, the count and the
+// journal's size as reads see them only with the space held exclusively, so
+// a read holding the space (either way) sees them consistent. The getters
+// need the space held.
 
 #include <memory>
 #include <string>
@@ -67,7 +71,7 @@ public:
     int64 Count() const { return m_count; }
     // The journal's bytes: a writer's file, or what a reader replayed.
     uint64 JournalBytes() const;
-    void SetReplayedJournalBytes(uint64 bytes) { m_replayedJournalBytes = bytes; }
+    void SetReplayedJournalBytes(uint64 bytes) { m_journalBytes = bytes; }
 
 private:
     TreeSpace& m_tree;
@@ -80,7 +84,7 @@ private:
     uint64 m_checkpointed = 0;
     int64 m_pending = 0;
     int64 m_count = 0;
-    uint64 m_replayedJournalBytes = 0;
+    uint64 m_journalBytes = 0;  // as of the last change reads may see
 };
 
 }  // namespace tarn

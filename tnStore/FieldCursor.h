@@ -21,8 +21,10 @@
 // while the cursor moves one way. A reader's handle sees what it saw when
 // it opened (tnStore/OffsetOpsStore.h), so its cursors see no change at all.
 //
-// A cursor refers to its store, which must outlive it; it uses the handle as
-// any call does (one thread at a time). It is movable, not copyable.
+// A cursor refers to its store, which must outlive it; it reads through the
+// handle as any call does, so cursors of one handle may move on several
+// threads beside the handle's other calls. One cursor is for one thread at a
+// time. It is movable, not copyable.
 
 #include <cstddef>
 #include <optional>

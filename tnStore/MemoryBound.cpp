@@ -70,7 +70,10 @@ bool MemoryBound::RoomForGrowth(ssize_t levels) const {
 }
 
 void MemoryBound::NotePeak() {
-    m_peak = std::max(m_peak, m_tree.Space().NumResidents());
+    const ssize_t now = m_tree.Space().NumResidents();
+    ssize_t peak = m_peak.load();
+    while (peak < now && !m_peak.compare_exchange_weak(peak, now)) {
+    }
 }
 
 }  // namespace tarn

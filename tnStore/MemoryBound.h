@@ -13,8 +13,10 @@
 // checkpoints and whole-tree walks end with Trim. A bound of 0 is no bound:
 // every call but the peak's does nothing.
 //
-// Owns the bound and the peak. Threads: a handle's; the calls that release
-// need the space exclusively.
+// Owns the bound and the peak. Threads: the calls that release need the
+// space exclusively; NotePeak and Peak may run in reads that hold it shared.
+
+#include <atomic>
 
 #include "tnStore/TreeSpace.h"
 
@@ -50,13 +52,13 @@ public:
     void NotePeak();
     ssize_t Peak() {
         NotePeak();
-        return m_peak;
+        return m_peak.load();
     }
 
 private:
     TreeSpace& m_tree;
     const ssize_t m_bound;
-    ssize_t m_peak = 0;
+    std::atomic<ssize_t> m_peak{0};  // noted by reads too, which may run together
 };
 
 }  // namespace tarn

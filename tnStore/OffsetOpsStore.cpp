@@ -84,8 +84,11 @@ OffsetOpsStore OffsetOpsStore::OpenInMemory(const StoreOptions& options) {
     return OffsetOpsStore(OpenStoreInMemory(options));
 }
 
+// Waits for every call still running (the life lock, exclusively), so that
+// no other thread is inside the handle when it lets go of its parts.
 void OffsetOpsStore::Close() {
     OffsetOpsStoreImpl& handle = State();
+    auto life = handle.LockLife();
     if (handle.IsClosed()) {
         return;
     }
@@ -93,11 +96,11 @@ void OffsetOpsStore::Close() {
         try {
             CloseWriter(handle);
         } catch (...) {
-            handle.Release();
+            handle.ReleaseLocked();
             throw;
         }
     }
-    handle.Release();
+    handle.ReleaseLocked();
 }
 
 bool OffsetOpsStore::IsReader() const {
@@ -128,18 +131,15 @@ OffsetOpsStoreImpl& OffsetOpsStore::State() const {
 
 void OffsetOpsStore::Record(const Opid& opid, const FieldId& field, int64 offset) {
     OffsetOpsStoreImpl& handle = State();
-    handle.RequireWritable();
-    CSpaceGuard guard(handle.Tree().Space(), LockMode::Exclusive);
-    // A bound too small for the tree throws before anything changes.
-    handle.Memory().MakeRoomForOperation();
-    handle.Writing([&] {
-        handle.Recording().Record(opid, field, offset);
-        handle.Checkpoints().AddRecord(opid, field, offset);
-    });
+    auto life = handle.ShareLife();
+    auto writer = handle.LockWriter();
+    handle.RecordOperation(opid, field, offset);
 }
 
 void OffsetOpsStore::Clear() {
     OffsetOpsStoreImpl& handle = State();
+    auto life = handle.ShareLife();
+    auto writer = handle.LockWriter();
     handle.RequireWritable();
     CSpaceGuard guard(handle.Tree().Space(), LockMode::Exclusive);
     handle.Writing([&] {
@@ -148,33 +148,35 @@ void OffsetOpsStore::Clear() {
     });
 }
 
+// Group commit: a thread's Sync waits for the writer lock while another
+// thread's Sync appends and syncs; that append took every operation recorded
+// before it, this thread's among them, so this Sync then finds nothing
+// pending and returns at once. One append and one sync serve every waiting
+// thread.
 void OffsetOpsStore::Sync() {
     OffsetOpsStoreImpl& handle = State();
-    handle.Writing([&] {
-        Checkpointer& checkpoints = handle.Checkpoints();
-        checkpoints.Sync();
-        if (checkpoints.JournalPast(handle.Options().journalLimitBytes)) {
-            checkpoints.WriteCheckpoint();
-        }
-    });
+    auto life = handle.ShareLife();
+    auto writer = handle.LockWriter();
+    handle.MakeDurable();
 }
 
 void OffsetOpsStore::Checkpoint() {
     OffsetOpsStoreImpl& handle = State();
-    handle.Writing([&] {
-        handle.Checkpoints().Sync();
-        handle.Checkpoints().WriteCheckpoint();
-    });
+    auto life = handle.ShareLife();
+    auto writer = handle.LockWriter();
+    handle.CheckpointNow();
 }
 
 CompactResult OffsetOpsStore::Compact() {
     OffsetOpsStoreImpl& handle = State();
+    auto life = handle.ShareLife();
+    auto writer = handle.LockWriter();
     handle.RequireWritable();
     DiskStore* disk = handle.Tree().Disk();
     if (disk == nullptr) {
         throw RuntimeError("an in-memory store has no file to compact");
     }
-    Checkpoint();
+    handle.CheckpointNow();
     CompactResult result;
     result.bytesBefore = disk->FileBytes();
     // The files are whole whatever happens; this handle's environment may not

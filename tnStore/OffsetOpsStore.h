@@ -19,14 +19,31 @@
 // callbacks, cursors) are copies (FieldTable, tnStore/FieldTable.h): they
 // stay as they were when read, whatever the store does afterwards.
 //
-// Concurrency. One handle is used by one thread at a time; it is not
-// thread-safe. Across handles and processes: one writer per store directory
-// (a second writer is refused at once with "in use"), and any number of
-// readers beside it. A reader sees, from the moment it opens, one consistent
-// checkpoint plus every durable point the writer had reached by then; it
-// never waits for the writer nor blocks it. Opening the same directory as
-// writer and reader in one process is not supported (LMDB's locks are per
-// process).
+// Threads. One handle may be shared by any number of threads:
+//   - Reads (Find, the ForEach walks, FieldCursor, Size, Height, Sites,
+//     Stats, Check, Validate, Dump, Backup) run beside each other on an
+//     unbounded store; on a bounded one (StoreOptions::cacheObjects) they
+//     take turns, since each may release nodes.
+//   - Writes (Record, Clear, Sync, Checkpoint, Merge, Compact, Close) may
+//     come from any thread, one at a time; a read waits for the tree change
+//     of a write in progress (not for its append or sync), and a write for
+//     the reads in progress.
+//   - A read sees the record after some prefix of the recorded operations:
+//     never a table half changed, and no table going back in a later read.
+//     Find copies one table at once; a walk or cursor reads a few hundred
+//     fields at once, each batch one consistent view (see FieldCursor.h).
+//   - Sync from several threads: the first to get its turn appends and syncs
+//     every operation recorded so far, and the others, whose operations that
+//     covered, return without another append (group commit). Each Sync
+//     returns once its own thread's operations are durable.
+//   - Close waits for the calls in progress; calls after it throw. Moving or
+//     destroying a handle while another thread uses it is not allowed.
+// Across handles and processes: one writer per store directory (a second
+// writer is refused at once with "in use"), and any number of readers beside
+// it in other processes. A reader sees, from the moment it opens, one
+// consistent checkpoint plus every durable point the writer had reached by
+// then; it never waits for the writer nor blocks it. Opening the same
+// directory twice in one process is refused ("in use").
 //
 // Durability. Record changes memory only. Sync() makes every operation
 // recorded so far durable: it appends them to the journal (one checksummed

@@ -320,6 +320,7 @@ BackupResult OffsetOpsStore::Backup(const std::filesystem::path& from,
 
 BackupResult OffsetOpsStore::Backup(const std::filesystem::path& to, const BackupOptions& options) {
     OffsetOpsStoreImpl& handle = State();
+    auto life = handle.ShareLife();
     handle.RequireOpen();
     DiskStore* disk = handle.Tree().Disk();
     if (disk == nullptr) {

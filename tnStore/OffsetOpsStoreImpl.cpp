@@ -47,7 +47,40 @@ void OffsetOpsStoreImpl::ApplyDeferred() {
     }
 }
 
+void OffsetOpsStoreImpl::RecordOperation(const Opid& opid, const FieldId& field, int64 offset) {
+    RequireWritable();
+    CSpaceGuard guard(Tree().Space(), LockMode::Exclusive);
+    // A bound too small for the tree throws before anything changes.
+    Memory().MakeRoomForOperation();
+    Writing([&] {
+        Recording().Record(opid, field, offset);
+        Checkpoints().AddRecord(opid, field, offset);
+    });
+}
+
+void OffsetOpsStoreImpl::MakeDurable() {
+    Writing([&] {
+        Checkpointer& checkpoints = Checkpoints();
+        checkpoints.Sync();
+        if (checkpoints.JournalPast(m_options.journalLimitBytes)) {
+            checkpoints.WriteCheckpoint();
+        }
+    });
+}
+
+void OffsetOpsStoreImpl::CheckpointNow() {
+    Writing([&] {
+        Checkpoints().Sync();
+        Checkpoints().WriteCheckpoint();
+    });
+}
+
 void OffsetOpsStoreImpl::Release() {
+    std::unique_lock life(m_life);
+    ReleaseLocked();
+}
+
+void OffsetOpsStoreImpl::ReleaseLocked() {
     if (m_parts != nullptr) {
         m_parts->checkpointer.CloseJournal();
     }

@@ -20,9 +20,26 @@
 // Reading (OffsetOpsStoreRead.cpp, FieldBatch.h) owns no state: each read
 // takes the space, applies the deferred operations and copies what it found.
 //
-// Threads: a handle's, one thread at a time (tnStore/OffsetOpsStore.h).
+// Threads (the rules users see are in tnStore/OffsetOpsStore.h). Three locks,
+// always taken in this order:
+//   life     shared by every call, exclusive for Release (Close): no call
+//            runs on parts that are gone
+//   writer   one write at a time (Record, Clear, Sync, Checkpoint, Merge,
+//            Compact, Close); held across a write's journal append and sync
+//   space    the object space's lock (CSpaceGuard): exclusive while the tree
+//            or what is kept about it changes, shared by the reads of an
+//            unbounded store (which neither load into a bound nor apply
+//            deferred operations), exclusive for the reads of a bounded one
+// Everything a read looks at (the tree, the positions, the bounds, the
+// counts) changes only under the space's lock held exclusively, so a read
+// sees the record after some prefix of the recorded operations and never a
+// table half changed.
 
+#include <atomic>
 #include <memory>
+#include <mutex>
+#include <optional>
+#include <shared_mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -56,7 +73,7 @@ public:
     const StoreOptions& Options() const { return m_options; }
     bool IsReader() const { return m_options.mode == StoreMode::Read; }
     bool IsClosed() const { return m_parts == nullptr; }
-    bool IsBroken() const { return m_broken; }
+    bool IsBroken() const { return m_broken.load(); }
     // "the store 'dir'", or "the store" for an in-memory one: for messages.
     std::string Named() const;
 
@@ -68,6 +85,7 @@ public:
     // Runs `write` for a writer, marking the handle broken when it fails
     // with anything but a refusal: a write that failed half way may leave
     // the tree changed in memory, and nothing more may become durable then.
+    // REQUIRES: the life lock shared and the writer lock held.
     template <class Write>
     decltype(auto) Writing(Write&& write) {
         RequireWritable();
@@ -80,17 +98,42 @@ public:
             throw;
         }
     }
-    // Runs `read` with the space held exclusively (reads load and release
-    // nodes) and the deferred operations applied. A failure to apply them
+    // Runs `read` with the life lock shared and the space held: shared for an
+    // unbounded store, exclusively for a bounded one (its reads release nodes
+    // and apply the deferred operations first). A failure to apply them
     // breaks the handle, as a failed write does.
     template <class Read>
     decltype(auto) Reading(Read&& read) {
+        std::shared_lock life(m_life);
+        return ReadingLocked(std::forward<Read>(read));
+    }
+    // The same for a caller that holds the life lock shared already.
+    template <class Read>
+    decltype(auto) ReadingLocked(Read&& read) {
         RequireOpen();
-        CSpaceGuard guard(Tree().Space(), LockMode::Exclusive);
-        ApplyDeferred();
+        const bool bounded = Memory().On();
+        CSpaceGuard guard(Tree().Space(), bounded ? LockMode::Exclusive : LockMode::Shared);
+        if (bounded) {
+            ApplyDeferred();
+        }
         return read();
     }
+    // REQUIRES: the space held exclusively.
     void ApplyDeferred();
+
+    // The writes, for callers that hold the life lock shared and the writer
+    // lock (the public calls, Merge).
+    void RecordOperation(const Opid& opid, const FieldId& field, int64 offset);
+    // A durable point, and a checkpoint when the journal has grown past its
+    // limit.
+    void MakeDurable();
+    // A durable point and a checkpoint.
+    void CheckpointNow();
+
+    // The life lock, shared, for a call; exclusive for Release.
+    std::shared_lock<std::shared_mutex> ShareLife() { return std::shared_lock(m_life); }
+    // The writer lock. REQUIRES: the life lock shared.
+    std::unique_lock<std::mutex> LockWriter() { return std::unique_lock(m_writer); }
 
     // The parts of an open handle (see above).
     TreeSpace& Tree() { return m_parts->tree; }
@@ -100,8 +143,12 @@ public:
     OpeningReport& Opening() { return m_opening; }
     const OpeningReport& Opening() const { return m_opening; }
 
-    // Lets go of everything the handle opened; the handle is closed.
+    // Lets go of everything the handle opened; the handle is closed. Takes
+    // the life lock exclusively: every call still running ends first.
     void Release();
+    // Release for a caller that holds the life lock exclusively already.
+    void ReleaseLocked();
+    std::unique_lock<std::shared_mutex> LockLife() { return std::unique_lock(m_life); }
 
 private:
     // Built and destroyed together, in this order: each refers to those
@@ -119,7 +166,13 @@ private:
     const StoreOptions m_options;
     OpeningReport m_opening;
     std::unique_ptr<Parts> m_parts;  // null once closed
-    bool m_broken = false;
+    std::atomic<bool> m_broken{false};
+    std::shared_mutex m_life;
+    std::mutex m_writer;
 };
+
+// The table of `field`, nothing when it has none. REQUIRES: the life lock
+// shared.
+std::optional<FieldTable> FindTable(OffsetOpsStoreImpl& handle, const FieldId& field);
 
 }  // namespace tarn

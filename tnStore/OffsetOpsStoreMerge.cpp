@@ -39,6 +39,11 @@ MergeResult OffsetOpsStore::Merge(const std::filesystem::path& fromDir,
                                   const MergeOptions& options) {
     const std::string from = fromDir.string();
     OffsetOpsStoreImpl& handle = State();
+    auto life = handle.ShareLife();
+    std::unique_lock<std::mutex> writer;
+    if (!options.dryRun) {
+        writer = handle.LockWriter();  // one write at a time: the whole merge
+    }
     if (options.dryRun) {
         handle.RequireOpen();
     } else {
@@ -58,7 +63,7 @@ MergeResult OffsetOpsStore::Merge(const std::filesystem::path& fromDir,
     int64 sinceDurable = 0;
     source.ForEach([&](const FieldId& field, const FieldTable& theirs) {
         ++result.fields;
-        const std::optional<FieldTable> ours = Find(field);
+        const std::optional<FieldTable> ours = FindTable(handle, field);
         for (const SiteRecord& their : theirs) {
             const Guid& site = their.site;
             const SiteRecord our = RecordOf(ours, site);
@@ -80,26 +85,26 @@ MergeResult OffsetOpsStore::Merge(const std::filesystem::path& fromDir,
             }
             for (int64 sum = our.o; sum != their.o;) {
                 const int64 step = StepToward(sum, their.o);
-                Record(Opid(site, their.t), field, step);
+                handle.RecordOperation(Opid(site, their.t), field, step);
                 sum += step;
                 ++result.operations;
                 ++sinceDurable;
             }
             if (our.o == their.o) {
                 // Equal sums under a later stamp: the stamp moves alone.
-                Record(Opid(site, their.t), field, 0);
+                handle.RecordOperation(Opid(site, their.t), field, 0);
                 ++result.operations;
                 ++sinceDurable;
             }
         }
         if (sinceDurable >= options.durableEvery) {
-            Sync();
+            handle.MakeDurable();
             sinceDurable = 0;
         }
         return true;
     });
     if (!options.dryRun) {
-        Sync();
+        handle.MakeDurable();
     }
     return result;
 }

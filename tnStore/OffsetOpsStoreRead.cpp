@@ -135,7 +135,12 @@ std::vector<FieldEntry> ReadBatch(OffsetOpsStoreImpl& handle, BatchFrom from, co
 
 std::optional<FieldTable> OffsetOpsStore::Find(const FieldId& field) {
     OffsetOpsStoreImpl& handle = State();
-    return handle.Reading([&]() -> std::optional<FieldTable> {
+    auto life = handle.ShareLife();
+    return FindTable(handle, field);
+}
+
+std::optional<FieldTable> FindTable(OffsetOpsStoreImpl& handle, const FieldId& field) {
+    return handle.ReadingLocked([&]() -> std::optional<FieldTable> {
         handle.Memory().MakeRoomForOperation();
         const OffsetOpsOnField<int64>* table = handle.Tree().Map().rFind(field);
         if (table == nullptr) {
@@ -179,8 +184,7 @@ ssize_t OffsetOpsStore::Height() {
 
 std::map<Guid, int64> OffsetOpsStore::Sites() {
     OffsetOpsStoreImpl& handle = State();
-    handle.RequireOpen();
-    return handle.Recording().Bounds().Newest();
+    return handle.Reading([&] { return handle.Recording().Bounds().Newest(); });
 }
 
 StoreStatistics OffsetOpsStore::Stats() {
@@ -220,7 +224,8 @@ StoreCheck OffsetOpsStore::Check() {
 
 StoreValidation OffsetOpsStore::Validate() {
     OffsetOpsStoreImpl& handle = State();
-    StoreValidation v = handle.Reading([&] {
+    auto life = handle.ShareLife();
+    StoreValidation v = handle.ReadingLocked([&] {
         StoreValidation found;
         found.record = handle.Tree().RecordOid();
         found.map = handle.Tree().Record().m_map.m_oid;
