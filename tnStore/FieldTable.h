@@ -3,6 +3,9 @@
 // What the store hands out for a field: its table, one record per site that
 // moved the field, in ascending site order. A record is the site's newest
 // time stamp for the field and the sum of all its offsets to it.
+//
+// Threads: plain values, copies of what the store held; like any standard
+// container, one may be read by several threads at once and changed by one.
 
 #include <string>
 #include <vector>
