@@ -394,6 +394,47 @@ TEST(ToolFormats, ReportsEscapeQuoteAndLayOutEachFormat) {
     EXPECT_EQ(empty.str(), "[]\n");
 }
 
+// JSON strings byte for byte as the program has always written them: every
+// control character escaped (\b and \f too, as \u forms), well-formed UTF-8
+// as it is, and one \ufffd for each byte that starts no well-formed sequence
+// (a cut-off sequence, an overlong form, a surrogate, past U+10FFFF). CSV
+// quotes a carriage return as it does a line feed.
+TEST(ToolFormats, JsonAndCsvQuoteEveryByteAsTheyAlwaysHave) {
+    for (int c = 0; c < 0x80; ++c) {
+        const std::string byte(1, static_cast<char>(c));
+        const std::string quoted = tool::JsonQuoted(byte);
+        EXPECT_EQ(ParseJson(quoted).text, byte) << "byte " << c << ": " << quoted;
+        EXPECT_EQ(quoted.size() == 3, c >= 0x20 && c < 0x7F && c != '"' && c != '\\') << c;
+    }
+    for (int c = 0x80; c < 0x100; ++c) {
+        EXPECT_EQ(tool::JsonQuoted(std::string(1, static_cast<char>(c))), "\"\\ufffd\"") << c;
+    }
+    const std::pair<std::string, std::string> cases[] = {
+        {"\b\f\x01\x1f\x7f", R"("\u0008\u000c\u0001\u001f\u007f")"},
+        {"\"\\/\r\n\t", R"("\"\\/\r\n\t")"},
+        {"\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80\xef\xbf\xbd",
+         "\"\xc3\xa9\xe2\x82\xac\xf0\x9f\x98\x80\xef\xbf\xbd\""},
+        {"\xe2\x82!", R"("\ufffd\ufffd!")"},
+        {"\xc0\x80", R"("\ufffd\ufffd")"},
+        {"\xe0\x80\x80", R"("\ufffd\ufffd\ufffd")"},
+        {"\xed\xa0\x80", R"("\ufffd\ufffd\ufffd")"},
+        {"\xf4\x90\x80\x80", R"("\ufffd\ufffd\ufffd\ufffd")"},
+        {"x\xc3", R"("x\ufffd")"},
+    };
+    for (const auto& [text, quoted] : cases) {
+        EXPECT_EQ(tool::JsonQuoted(text), quoted);
+    }
+    const tool::Json nested{{"a\x01", tool::Json::array({1, -2, true, nullptr, "\xff"})},
+                            {"b", tool::Json::object()},
+                            {"u", UINT64_MAX}};
+    EXPECT_EQ(tool::JsonText(nested),
+              R"({"a\u0001":[1,-2,true,null,"\ufffd"],"b":{},"u":18446744073709551615})");
+
+    EXPECT_EQ(tool::CsvField("a\rb"), "\"a\rb\"");
+    EXPECT_EQ(tool::CsvField("\""), "\"\"\"\"");
+    EXPECT_EQ(tool::CsvField("a b\t\\"), "a b\t\\");
+}
+
 // ---------------------------------------------------------------------------
 
 // A refused line names the --skip that goes on after it once it is fixed;

@@ -4,10 +4,6 @@
 
 namespace tarn::tool {
 
-std::string JsonText(const Json& value) {
-    return value.dump(-1, ' ', false, Json::error_handler_t::replace);
-}
-
 Json TableJson(const FieldTable& table) {
     Json records = Json::array();
     for (const SiteRecord& r : table) {

@@ -14,10 +14,9 @@
 //              csv   a header and rows
 // JSON documents put each element of their outermost object or array on a
 // line of its own, so that a long document reads (and greps) a line an
-// element; everything inside one is on its line. JSON is made by
-// nlohmann::json: strings are escaped as JSON needs, and bytes that are not
-// UTF-8 are written as U+FFFD. CSV fields are quoted where they hold a comma,
-// a quote or a line break.
+// element; everything inside one is on its line (tools/JsonText.h, which
+// also says how strings are escaped). CSV fields are quoted where they hold
+// a comma, a quote or a line break.
 
 #include <functional>
 #include <ostream>
@@ -25,18 +24,12 @@
 #include <string_view>
 #include <vector>
 
-#include <nlohmann/json.hpp>
-
 #include "tnStore/FieldTable.h"
+#include "tools/JsonText.h"
 
 namespace tarn::tool {
 
 enum class Format { Text, Json, Csv };
-
-using Json = nlohmann::ordered_json;
-
-// One JSON value on one line, as the documents write their elements.
-std::string JsonText(const Json& value);
 
 // A table's records as an array of {"site", "t", "o"} objects.
 Json TableJson(const FieldTable& table);
