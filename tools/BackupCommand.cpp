@@ -74,12 +74,13 @@ int RunBackup(const Arguments& args, Io& io) {
         return stopped();
     }
     line.Finish();
-    io.out << "backed up '" << dir << "' to '" << to << "'" << (compact ? " (compacted)" : "")
-           << '\n';
-    Row(io.out, "durable operations", std::to_string(result.durableOperations));
-    Row(io.out, "in the data file", std::to_string(result.checkpointedOperations));
-    Row(io.out, "data file", BytesText(static_cast<uint64>(result.dataBytes)));
-    Row(io.out, "journal", BytesText(static_cast<uint64>(result.journalBytes)));
+    Summary summary;
+    summary.TextLine("backed up '" + dir + "' to '" + to + "'" + (compact ? " (compacted)" : ""))
+        .TextRow("durable operations", std::to_string(result.durableOperations))
+        .TextRow("in the data file", std::to_string(result.checkpointedOperations))
+        .TextRow("data file", BytesText(static_cast<uint64>(result.dataBytes)))
+        .TextRow("journal", BytesText(static_cast<uint64>(result.journalBytes)));
+    summary.Write(io.out, Format::Text);
     return 0;
 }
 

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <iomanip>
 
 #include "tools/Output.h"
 
@@ -11,10 +10,6 @@ namespace tarn::tool {
 int Fail(std::ostream& err, const std::string& message) {
     err << "offsetops: " << message << '\n';
     return 1;
-}
-
-void Row(std::ostream& out, const char* label, const std::string& value) {
-    out << std::left << std::setw(22) << label << value << '\n';
 }
 
 std::string NodesText(const StoreStatistics& stats) {

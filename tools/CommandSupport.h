@@ -14,9 +14,6 @@ namespace tarn::tool {
 // Writes "offsetops: <message>" and returns 1.
 int Fail(std::ostream& err, const std::string& message);
 
-// "label                 value", the rows of the summaries.
-void Row(std::ostream& out, const char* label, const std::string& value);
-
 // "12 (10 leaves, 2 internal)".
 std::string NodesText(const StoreStatistics& stats);
 

@@ -128,7 +128,7 @@ private:
         const StoreStatistics stats = m_store.Stats();
         m_store.Close();
         m_progress.Finish();
-        Summary(stats);
+        WriteSummary(stats);
     }
 
     int Finished() {
@@ -192,28 +192,30 @@ private:
                         " lost" + GoOn("", m_durableLines));
     }
 
-    void Summary(const StoreStatistics& stats) {
+    // What the run did, as "label   value" rows (record has no --format).
+    void WriteSummary(const StoreStatistics& stats) {
         const double seconds = std::chrono::duration<double>(Clock::now() - m_start).count();
         std::ostringstream rate;
         rate << std::fixed << std::setprecision(0)
              << (seconds > 0 ? static_cast<double>(m_recorded) / seconds : 0.0);
         std::ostringstream elapsed;
         elapsed << std::fixed << std::setprecision(3) << seconds;
-        std::ostream& out = m_io.out;
-        Row(out, "operations", std::to_string(m_recorded));
-        Row(out, "fields", std::to_string(stats.fields));
-        Row(out, "nodes", NodesText(stats));
-        Row(out, "height", std::to_string(stats.height));
-        Row(out, "durable points", std::to_string(m_durablePoints));
-        Row(out, "checkpoints", std::to_string(stats.checkpoints));
-        Row(out, "images written", std::to_string(stats.imagesWritten));
-        Row(out, "bytes written", std::to_string(stats.imageBytesWritten));
         const ssize_t bound = m_settings.cacheObjects;
-        Row(out, "peak residents",
-            std::to_string(stats.peakResidents) +
-                (bound > 0 ? " (bound " + std::to_string(bound) + ")" : std::string()));
-        Row(out, "seconds", elapsed.str());
-        Row(out, "operations/s", rate.str());
+        tool::Summary summary;
+        summary.TextRow("operations", std::to_string(m_recorded))
+            .TextRow("fields", std::to_string(stats.fields))
+            .TextRow("nodes", NodesText(stats))
+            .TextRow("height", std::to_string(stats.height))
+            .TextRow("durable points", std::to_string(m_durablePoints))
+            .TextRow("checkpoints", std::to_string(stats.checkpoints))
+            .TextRow("images written", std::to_string(stats.imagesWritten))
+            .TextRow("bytes written", std::to_string(stats.imageBytesWritten))
+            .TextRow("peak residents",
+                     std::to_string(stats.peakResidents) +
+                         (bound > 0 ? " (bound " + std::to_string(bound) + ")" : std::string()))
+            .TextRow("seconds", elapsed.str())
+            .TextRow("operations/s", rate.str());
+        summary.Write(m_io.out, Format::Text);
     }
 
     OffsetOpsStore& m_store;

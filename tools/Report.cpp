@@ -1,8 +1,15 @@
 #include "tools/Report.h"
 
-#include "tools/CommandSupport.h"
+#include <iomanip>
 
 namespace tarn::tool {
+
+namespace {
+
+// A summary's text rows start their values in this column.
+constexpr int kLabelWidth = 22;
+
+}  // namespace
 
 Json TableJson(const FieldTable& table) {
     Json records = Json::array();
@@ -96,7 +103,8 @@ void Summary::WriteText(std::ostream& out) const {
         if (e.label.empty()) {
             out << e.text << '\n';
         } else {
-            tool::Row(out, e.label.c_str(), e.text.empty() ? PlainText(e.value) : e.text);
+            out << std::left << std::setw(kLabelWidth) << e.label
+                << (e.text.empty() ? PlainText(e.value) : e.text) << '\n';
         }
     }
 }

@@ -4,8 +4,9 @@
 // written in the format of --format (text, JSON or CSV).
 //
 // Two shapes:
-//   Summary  named values (stats, validate):
-//              text  "label   value" rows and lines of their own
+//   Summary  named values (stats, validate; record's and backup's, text only):
+//              text  "label   value" rows, values from column 23, and lines
+//                    of their own
 //              json  one object
 //              csv   "name,value" and a row per value
 //   Listing  a stream of items, as long as a store (sites, show, diff):
