@@ -15,7 +15,7 @@
 
 #include "tnOperation/FieldId.h"
 #include "tnUtils/Types.h"
-#include "tools/Output.h"
+#include "tools/Report.h"
 
 namespace tarn::tool {
 

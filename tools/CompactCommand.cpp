@@ -15,10 +15,6 @@ std::string MiBText(int64 bytes) {
     return text;
 }
 
-}  // namespace
-
-namespace {
-
 int RunCompact(const Arguments& args, Io& io) {
     const std::string store = args.Store();
     OffsetOpsStore opened = OpenAndReport(store, StoreMode::WriteExisting, io.err);

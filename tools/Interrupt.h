@@ -2,11 +2,11 @@
 
 // SIGINT and SIGTERM ask offsetops to stop. In the commands that have
 // something to finish or to remove (record, export, backup), the first one is
-// caught and noted; they look at it at their safe points (record at its next
-// durable point, export between fields, backup from a thread that watches)
-// and end with status 128 + the signal: 130 for SIGINT, 143 for SIGTERM. A
-// second one ends the program at once, as the signal does by default, and
-// so does the first in every other command.
+// caught and noted; they look at it at their safe points (record before each
+// operation, and then makes what it recorded durable; export between fields;
+// backup from a thread that watches) and end with status 128 + the signal:
+// 130 for SIGINT, 143 for SIGTERM. A second one ends the program at once, as
+// the signal does by default, and so does the first in every other command.
 //
 // A blocking read of standard input is interrupted by the first one (the
 // handler is installed without SA_RESTART), so a record waiting on a pipe

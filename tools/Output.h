@@ -7,7 +7,6 @@
 #include <string_view>
 
 #include "tnUtils/Types.h"
-#include "tools/Report.h"
 
 namespace tarn::tool {
 
