@@ -71,8 +71,8 @@ Summary& Summary::List(std::string name, std::string csvName, std::string textPr
     for (const std::string& item : items) {
         array.push_back(item);
     }
-    // The CSV rows and text lines are entries of their own; the JSON array
-    // comes after them, which only the other formats' order could see.
+    // A CSV row and a text line per item, then the one JSON member. Each
+    // format writes only its own entries, so none sees this order.
     for (const std::string& item : items) {
         m_entries.push_back({kCsv, csvName, item, {}, {}});
         m_entries.push_back({kText, {}, {}, {}, textPrefix + item});
